@@ -1,0 +1,45 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/property_list_value.h"
+
+namespace kel::platform {
+
+/// An opened bundle; closed by destruction. One thread at a time.
+class Bundle {
+ public:
+  virtual ~Bundle() = default;
+
+  /// The information dictionary; empty when there is none that can be read.
+  virtual PropertyListDictionary informationDictionary() = 0;
+
+  /// The bundle's identifier as declared, of whatever kind; absent when none is.
+  virtual std::optional<PropertyListValue> identifier() = 0;
+
+  /// The path of the resource `name` of `type` for `localization`; absent when there is no such file.
+  virtual std::optional<std::string> resourcePath(std::string_view name, std::string_view type,
+                                                  std::string_view localization) = 0;
+};
+
+/// Opens bundles. Any thread.
+class Bundles {
+ public:
+  virtual ~Bundles() = default;
+
+  /// The bundle in the directory `path`, or null when there is no directory.
+  virtual std::unique_ptr<Bundle> open(const std::string& path) = 0;
+};
+
+/// Makes the identifier that every bundle implementation reports from an information dictionary.
+std::optional<PropertyListValue> bundleIdentifier(const PropertyListDictionary& informationDictionary);
+
+/// The path of a resource below its bundle ("Resources/LOC/NAME.TYPE"); absent for a localization name that
+/// is empty, longer than 128 bytes, begins with a dot or holds a "/" or a NUL.
+std::optional<std::string> localizedResourceName(std::string_view name, std::string_view type,
+                                                 std::string_view localization);
+
+}  // namespace kel::platform

@@ -1,0 +1,21 @@
+#pragma once
+
+#include <functional>
+#include <string_view>
+
+#include "platform/work_queue.h"
+
+namespace kel::platform {
+
+/// The streams through which the launcher forwards notifications to the server.
+class LaunchEvents {
+ public:
+  virtual ~LaunchEvents() = default;
+
+  /// Runs `handler` on `queue` for every event of the stream, and once at the start: what changed while no
+  /// server ran is not told otherwise. One handler per stream; called before the main event loop is entered.
+  /// `queue` outlives this object.
+  virtual void setHandler(std::string_view stream, SerialQueue& queue, std::function<void()> handler) = 0;
+};
+
+}  // namespace kel::platform
