@@ -89,9 +89,9 @@ TEST(BinaryPropertyListReaderTest, EverySizeOfOffsetsAndReferencesInAnyOrderIsRe
   expected.set("k", PropertyListArray{"k", 7, 7});
   for (std::size_t size = 1; size <= 8; ++size) {
     std::string dictionary = "\xD1";
-    for (const std::uint64_t reference : {0, 1}) appendNumber(dictionary, reference, size);
+    for (const unsigned reference : {0U, 1U}) appendNumber(dictionary, reference, size);
     std::string array = "\xA3";
-    for (const std::uint64_t reference : {0, 2, 2}) appendNumber(array, reference, size);
+    for (const unsigned reference : {0U, 2U, 2U}) appendNumber(array, reference, size);
     const PropertyListReading reading =
         read(file({"\x51k", array, "\x10\x07", dictionary, "junk"}, size, size, 3));
     ASSERT_EQ(reading.error, "");
