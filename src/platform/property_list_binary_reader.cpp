@@ -1,3 +1,4 @@
+#include <algorithm>
 #include <bit>
 #include <cstring>
 
@@ -32,6 +33,7 @@ class BinaryReader {
   PropertyListValue read() {
     const std::uint64_t top = readTrailer();
     slots_.resize(count_, unread);
+    decoded_.reserve(std::min<std::size_t>(count_, bytes_.size() / 16));
     budget_.spend(PropertyListBudget::valueCost, headerSize);
     resolve(top, bytes_.size() - 16);
     while (!open_.empty()) {
@@ -109,8 +111,10 @@ class BinaryReader {
       open(object, position, kind == 0xD);
     } else {
       PropertyListValue value = leaf(position);
-      budget_.spend(value.expandedSize() - PropertyListBudget::valueCost, position);
-      if (value.asSharedString() || value.asData()) remember(object, value);
+      if (value.asSharedString() || value.asData()) {
+        budget_.spend(value.expandedSize() - PropertyListBudget::valueCost, position);
+        remember(object, value);
+      }
       values_.push_back(std::move(value));
     }
   }

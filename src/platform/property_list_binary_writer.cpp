@@ -83,8 +83,7 @@ class BinaryWriter {
     }
     const std::uint64_t offsetTable = size();
     const std::size_t offsetSize = sizeFor(offsets.back());
-    buffer_.reserve(buffer_.size() + offsets.size() * offsetSize + 32);
-    for (const std::uint64_t offset : offsets) appendNumber(offset, offsetSize);
+    appendNumbers(offsets.data(), offsets.size(), offsetSize);
     appendNumber(0, 6);
     appendNumber(offsetSize, 1);
     appendNumber(referenceSize, 1);
@@ -229,10 +228,8 @@ class BinaryWriter {
   }
 
   const std::uint32_t* writeReferences(const std::uint32_t* references, std::size_t count, std::size_t size) {
-    for (const std::uint32_t* end = references + count; references != end; ++references) {
-      appendNumber(*references, size);
-    }
-    return references;
+    appendNumbers(references, count, size);
+    return references + count;
   }
 
   void writeMarker(std::uint8_t kind, std::uint64_t count) {
@@ -297,9 +294,23 @@ class BinaryWriter {
   }
 
   void appendNumber(std::uint64_t number, std::size_t size) {
-    std::uint8_t bytes[8];
-    for (std::size_t i = 0; i < size; ++i) bytes[i] = static_cast<std::uint8_t>(number >> 8 * (size - 1 - i));
-    buffer_.insert(buffer_.end(), bytes, bytes + size);
+    if (size == 1) {
+      buffer_.push_back(static_cast<std::uint8_t>(number));
+    } else {
+      appendNumbers(&number, 1, size);
+    }
+  }
+
+  template <typename Number>
+  void appendNumbers(const Number* numbers, std::size_t count, std::size_t size) {
+    const std::size_t end = buffer_.size();
+    buffer_.resize(end + count * size);
+    std::uint8_t* next = buffer_.data() + end;
+    for (std::size_t n = 0; n < count; ++n) {
+      for (std::size_t i = size; i-- > 0;) {
+        *next++ = static_cast<std::uint8_t>(static_cast<std::uint64_t>(numbers[n]) >> 8 * i);
+      }
+    }
   }
 
   void append(std::string_view text) { buffer_.insert(buffer_.end(), text.begin(), text.end()); }
