@@ -1,0 +1,113 @@
+#include "platform/linux/endpoint_socket.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <system_error>
+#include <unistd.h>
+#include <utility>
+
+namespace kel::platform {
+
+namespace {
+
+std::optional<sockaddr_un> socketAddress(const std::string& path) {
+  sockaddr_un address{};
+  if (path.empty() || path.size() >= sizeof address.sun_path) return std::nullopt;
+  address.sun_family = AF_UNIX;
+  std::copy(path.begin(), path.end(), address.sun_path);
+  return address;
+}
+
+EndpointBinding failed(const std::string& path) {
+  return {std::nullopt, false, path + ": " + std::generic_category().message(errno)};
+}
+
+EndpointBinding servedElsewhere(const std::string& path) {
+  return {std::nullopt, true, path + ": another server holds the endpoint"};
+}
+
+enum class Occupant { Nobody, Dead, Live, Unknown };
+
+/// Whose socket file `path` is; `errno` says why for `Unknown`.
+Occupant occupant(const std::string& path) {
+  struct stat status {};
+  if (lstat(path.c_str(), &status) != 0) return errno == ENOENT ? Occupant::Nobody : Occupant::Unknown;
+  if (!S_ISSOCK(status.st_mode)) {
+    errno = EEXIST;
+    return Occupant::Unknown;
+  }
+  // A full queue of connections (EAGAIN) has a server that is to accept them.
+  if (connectToEndpoint(path, SOCK_NONBLOCK) || errno == EAGAIN) return Occupant::Live;
+  return errno == ECONNREFUSED ? Occupant::Dead : Occupant::Unknown;
+}
+
+/// Bound and listening, reachable for the user alone whatever the file-creation mask.
+OwnedDescriptor bindAndListen(const std::string& path) {
+  OwnedDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  const auto address = socketAddress(path);
+  if (!address) errno = ENAMETOOLONG;
+  // The socket's own mode is what its file is made with.
+  if (!socket || !address || fchmod(socket.get(), 0600) != 0 ||
+      bind(socket.get(), reinterpret_cast<const sockaddr*>(&*address), sizeof *address) != 0 ||
+      chmod(path.c_str(), 0600) != 0 || listen(socket.get(), SOMAXCONN) != 0) {
+    return {};
+  }
+  return socket;
+}
+
+}  // namespace
+
+EndpointSocket::~EndpointSocket() {
+  if (socket_ && !path_.empty()) unlink(path_.c_str());
+}
+
+EndpointBinding bindEndpoint(const std::string& path) {
+  OwnedDescriptor lock(
+      open((path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0600));
+  if (!lock) return failed(path + ".lock");
+  while (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
+    if (errno == EWOULDBLOCK) return servedElsewhere(path);
+    if (errno != EINTR) return failed(path + ".lock");
+  }
+  switch (occupant(path)) {
+    case Occupant::Live:
+      return servedElsewhere(path);
+    case Occupant::Unknown:
+      return failed(path);
+    case Occupant::Dead:
+      if (unlink(path.c_str()) != 0) return failed(path);
+      break;
+    case Occupant::Nobody:
+      break;
+  }
+  OwnedDescriptor socket = bindAndListen(path);
+  if (!socket) return failed(path);
+  EndpointBinding binding;
+  binding.socket.emplace(std::move(socket), std::move(lock), path);
+  return binding;
+}
+
+OwnedDescriptor connectToEndpoint(const std::string& path, int flags) {
+  const auto address = socketAddress(path);
+  if (!address) {
+    errno = ENAMETOOLONG;
+    return {};
+  }
+  OwnedDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | flags, 0));
+  if (!socket) return {};
+  while (connect(socket.get(), reinterpret_cast<const sockaddr*>(&*address), sizeof *address) != 0) {
+    if (errno == EINTR) continue;
+    const int error = errno;
+    socket.reset();
+    errno = error;
+    return {};
+  }
+  return socket;
+}
+
+}  // namespace kel::platform
