@@ -1,0 +1,100 @@
+#include "platform/linux/files.h"
+
+#include <cerrno>
+#include <chrono>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/random.h>
+#include <sys/stat.h>
+
+namespace kel::platform {
+
+std::string errorText(int errorNumber) {
+  const char* text = strerrordesc_np(errorNumber);
+  return text ? text : "Error " + std::to_string(errorNumber);
+}
+
+std::string errorLine(const std::string& path, int errorNumber) {
+  return path + ": " + errorText(errorNumber);
+}
+
+OwnedDescriptor openFile(int directory, const std::string& path, int flags, mode_t mode) {
+  if (path.find('\0') != std::string::npos) {
+    errno = EINVAL;
+    return {};
+  }
+  for (;;) {
+    OwnedDescriptor file(openat(directory, path.c_str(), flags | O_CLOEXEC, mode));
+    if (file || errno != EINTR) return file;
+  }
+}
+
+bool writeWhole(int descriptor, BytesView bytes) {
+  while (!bytes.empty()) {
+    const ssize_t written = write(descriptor, bytes.data(), bytes.size());
+    if (written < 0 && errno == EINTR) continue;
+    if (written == 0) errno = ENOSPC;
+    if (written <= 0) return false;
+    bytes = bytes.subspan(static_cast<std::size_t>(written));
+  }
+  return true;
+}
+
+std::optional<std::string> readSmallFile(int directory, const std::string& path, std::size_t largest) {
+  const OwnedDescriptor file = openFile(directory, path, O_RDONLY | O_NONBLOCK | O_NOCTTY);
+  struct stat status {};
+  if (!file || fstat(file.get(), &status) != 0) return std::nullopt;
+  if (!S_ISREG(status.st_mode)) {
+    errno = EINVAL;
+    return std::nullopt;
+  }
+  std::string text;
+  for (;;) {
+    char buffer[4096];
+    const ssize_t count = read(file.get(), buffer, sizeof buffer);
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0) return std::nullopt;
+    if (count == 0) return text;
+    text.append(buffer, static_cast<std::size_t>(count));
+    if (text.size() > largest) {
+      errno = EFBIG;
+      return std::nullopt;
+    }
+  }
+}
+
+bool makeDirectories(const std::string& path) {
+  if (path.find('\0') != std::string::npos) {
+    errno = EINVAL;
+    return false;
+  }
+  if (isDirectory(path)) return true;
+  for (std::size_t end = path.find('/', 1); end != std::string::npos; end = path.find('/', end + 1)) {
+    if (mkdir(path.substr(0, end).c_str(), 0700) != 0 && errno != EEXIST) return false;
+  }
+  if (mkdir(path.c_str(), 0700) == 0 || isDirectory(path)) return true;
+  if (errno == EEXIST) errno = ENOTDIR;
+  return false;
+}
+
+bool isDirectory(const std::string& path) {
+  struct stat status {};
+  if (path.find('\0') != std::string::npos) return false;
+  const int kept = errno;
+  const bool found = stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
+  errno = kept;
+  return found;
+}
+
+std::uint64_t randomNumber() {
+  std::uint64_t number = 0;
+  ssize_t got = 0;
+  do {
+    got = getrandom(&number, sizeof number, 0);
+  } while (got < 0 && errno == EINTR);
+  if (got == sizeof number) return number;
+  const auto now = std::chrono::steady_clock::now().time_since_epoch().count();
+  return static_cast<std::uint64_t>(now) ^ static_cast<std::uint64_t>(getpid()) << 40;
+}
+
+}  // namespace kel::platform
