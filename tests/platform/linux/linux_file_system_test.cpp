@@ -13,9 +13,7 @@ namespace kel::platform {
 namespace {
 
 using testing::ElementsAre;
-using testing::EndsWith;
 using testing::HasSubstr;
-using testing::IsEmpty;
 using testing::UnorderedElementsAre;
 using namespace std::string_literals;
 
