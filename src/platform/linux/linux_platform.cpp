@@ -1,0 +1,35 @@
+#include "platform/linux/linux_platform.h"
+
+namespace kel::platform {
+
+namespace {
+
+/// Where notification records are kept; without a runtime directory a place that cannot be made.
+std::string recordDirectory(const RuntimeDirectory& runtime) {
+  return runtime.path ? joinPath(*runtime.path, "beacond") : "/dev/null/beacond";
+}
+
+}  // namespace
+
+LinuxPlatform::LinuxPlatform()
+    : runtimeDirectory_(resolveRuntimeDirectory()),
+      files_(log_),
+      directories_(facts_, runtimeDirectory_.path),
+      bundles_(files_, log_),
+      transactions_(facts_.environmentVariable("NOTIFY_SOCKET")),
+      conduit_(log_, clock_,
+               {.trackActivity = [this] { transactions_.trackActivity(); },
+                .runtimeDirectory = [this] { return runtimeDirectory_; }}),
+      seeds_(recordDirectory(runtimeDirectory_), log_),
+      launchEvents_(seeds_, log_),
+      publication_(files_, log_, directories_.stateDirectory()),
+      preferences_(files_, directories_.stateDirectory(), directories_.configurationDirectory()),
+      applications_(files_, log_, concurrentQueue_,
+                    LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory())),
+      platform_{clock_,       concurrentQueue_, files_,        directories_, bundles_,      facts_,
+                log_,         transactions_,    conduit_,      sandbox_,     launchEvents_, seeds_,
+                publication_, preferences_,     applications_, journal_,     process_,      constants_} {
+  if (!runtimeDirectory_.path) log_.write("No runtime directory: " + runtimeDirectory_.error);
+}
+
+}  // namespace kel::platform
