@@ -8,6 +8,7 @@
 #endif
 
 #define KEL_CAPABILITY(name) KEL_ATTRIBUTE(capability(name))
+#define KEL_RETURNS_CAPABILITY(x) KEL_ATTRIBUTE(lock_returned(x))
 #define KEL_ASSERTS_CAPABILITY(...) KEL_ATTRIBUTE(assert_capability(__VA_ARGS__))
 
 /// A member that is touched only on the given queue.
