@@ -1,0 +1,50 @@
+#include "restrictions/restriction_list_entry.h"
+
+#include <functional>
+#include <string>
+#include <utility>
+
+#include "common/service_keys.h"
+
+namespace kel {
+
+namespace {
+
+using platform::PropertyListDictionary;
+using platform::PropertyListString;
+using platform::PropertyListValue;
+
+const PropertyListString bundleIDKey = "QVBundleID";
+
+std::optional<PropertyListString> stringUnder(const PropertyListDictionary& dictionary,
+                                              const PropertyListString& key) {
+  const PropertyListValue* value = dictionary.find(key.text());
+  const PropertyListString* string = value ? value->asSharedString() : nullptr;
+  return string ? std::optional(*string) : std::nullopt;
+}
+
+}  // namespace
+
+KELRestrictionListEntry::KELRestrictionListEntry(PropertyListString bundleID, PropertyListString title)
+    : bundleID_(std::move(bundleID)), title_(std::move(title)) {}
+
+std::optional<KELRestrictionListEntry> KELRestrictionListEntry::initWithBundleID(
+    std::optional<PropertyListString> bundleID, std::optional<PropertyListString> title) {
+  if (!bundleID || !title) return std::nullopt;
+  return KELRestrictionListEntry(*std::move(bundleID), *std::move(title));
+}
+
+std::optional<KELRestrictionListEntry> KELRestrictionListEntry::initWithDictionaryRepresentation(
+    const PropertyListValue& representation) {
+  const PropertyListDictionary* row = representation.asDictionary();
+  if (!row) return std::nullopt;
+  return initWithBundleID(stringUnder(*row, bundleIDKey), stringUnder(*row, service_key::menuItem));
+}
+
+PropertyListDictionary KELRestrictionListEntry::dictionaryRepresentation() const {
+  return PropertyListDictionary({{bundleIDKey, bundleID_}, {service_key::menuItem, title_}});
+}
+
+std::size_t KELRestrictionListEntry::hash() const { return std::hash<std::string>{}(title_.text()); }
+
+}  // namespace kel

@@ -1,0 +1,99 @@
+#include "restrictions/restriction_lists.h"
+
+#include <string>
+#include <string_view>
+#include <unordered_set>
+#include <utility>
+
+#include "common/service_keys.h"
+
+namespace kel {
+
+namespace {
+
+using platform::PropertyListArray;
+using platform::PropertyListDictionary;
+using platform::PropertyListDictionaryBuilder;
+using platform::PropertyListString;
+using platform::PropertyListValue;
+
+using EntrySet = std::unordered_set<KELRestrictionListEntry, KELRestrictionListEntry::Hash>;
+
+constexpr std::string_view unrestrictedKey = "QVUnrestricted";
+constexpr std::string_view restrictedKey = "QVRestricted";
+
+PropertyListArray arrayUnder(const PropertyListDictionary& dictionary, std::string_view key) {
+  const PropertyListValue* value = dictionary.find(key);
+  const PropertyListArray* array = value ? value->asArray() : nullptr;
+  return array ? *array : PropertyListArray();
+}
+
+std::optional<PropertyListString> sharedString(const PropertyListValue* value) {
+  const PropertyListString* string = value ? value->asSharedString() : nullptr;
+  return string ? std::optional(*string) : std::nullopt;
+}
+
+}  // namespace
+
+std::optional<PropertyListDictionary> load_restrictions_file(platform::FileSystem& files,
+                                                             platform::StandardDirectories& directories) {
+  const std::vector<std::string> libraries = directories.systemLibraryDirectories();
+  if (libraries.empty()) return std::nullopt;
+  const std::string path = platform::joinPath(platform::joinPath(libraries.back(), "CoreAgents"),
+                                              "com.orvex.QVServicesRestrictions.plist");
+  return platform::readDictionaryFile(files, path, platform::largestForeignFile).dictionary;
+}
+
+std::shared_ptr<const KELRestrictionLists> restriction_lists_from_plist(
+    const std::optional<PropertyListDictionary>& plist) {
+  if (!plist) return nullptr;
+  const RestrictionListsOf<PropertyListValue> rows{arrayUnder(*plist, unrestrictedKey),
+                                                   arrayUnder(*plist, restrictedKey)};
+  return std::make_shared<const KELRestrictionLists>(
+      transform_restriction_lists(rows, &KELRestrictionListEntry::initWithDictionaryRepresentation));
+}
+
+std::optional<PropertyListDictionary> restriction_lists_to_plist(const KELRestrictionLists* lists) {
+  if (!lists) return std::nullopt;
+  auto rows = transform_restriction_lists(*lists, [](const KELRestrictionListEntry& entry) {
+    return std::optional<PropertyListValue>(entry.dictionaryRepresentation());
+  });
+  return PropertyListDictionary({{unrestrictedKey, PropertyListArray(std::move(rows.unrestricted))},
+                                 {restrictedKey, PropertyListArray(std::move(rows.restricted))}});
+}
+
+void apply_restriction_lists(std::vector<PropertyListDictionaryBuilder>& services,
+                             const KELRestrictionLists* lists) {
+  EntrySet unrestricted;
+  EntrySet restricted;
+  if (lists) {
+    unrestricted.insert(lists->unrestricted.begin(), lists->unrestricted.end());
+    restricted.insert(lists->restricted.begin(), lists->restricted.end());
+  }
+  for (PropertyListDictionaryBuilder& service : services) {
+    if (service.find(service_key::restricted)) continue;
+    const std::optional<KELRestrictionListEntry> entry = restriction_entry_for_service(service);
+    if (!entry) continue;
+    if (restricted.contains(*entry) || (is_vendor_service(service) && !unrestricted.contains(*entry))) {
+      service.set(service_key::restricted, true);
+    }
+  }
+}
+
+bool is_vendor_service(const ServiceView& service) {
+  const PropertyListValue* identifier = service.find(service_key::bundleIdentifier);
+  const std::string* text = identifier ? identifier->asString() : nullptr;
+  return text && text->starts_with("com.orvex.");
+}
+
+std::optional<KELRestrictionListEntry> restriction_entry_for_service(const ServiceView& service) {
+  const PropertyListValue* menuItem = service.find(service_key::menuItem);
+  const PropertyListDictionary* titles = menuItem ? menuItem->asDictionary() : nullptr;
+  if (!titles) return std::nullopt;
+  std::optional<PropertyListString> title = sharedString(titles->find(service_key::defaultTitle.text()));
+  if (!title) title = sharedString(titles->find("English"));
+  return KELRestrictionListEntry::initWithBundleID(sharedString(service.find(service_key::bundleIdentifier)),
+                                                   std::move(title));
+}
+
+}  // namespace kel

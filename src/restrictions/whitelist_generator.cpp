@@ -1,0 +1,75 @@
+#include "restrictions/whitelist_generator.h"
+
+#include <ostream>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "common/common.h"
+#include "restrictions/restriction_lists.h"
+
+namespace kel {
+
+namespace {
+
+using platform::PropertyListDictionary;
+using platform::PropertyListString;
+using platform::PropertyListValue;
+
+using Entries = std::vector<KELRestrictionListEntry>;
+
+Entries vendorServicesOf(const PropertyListValue& publication) {
+  const PropertyListDictionary* dictionary = publication.asDictionary();
+  const PropertyListValue* services = dictionary ? dictionary->find("KTVendedServices") : nullptr;
+  if (!services || !services->asArray()) return {};
+  return map_array(*services->asArray(), [](const PropertyListValue& value) {
+    const PropertyListDictionary* service = value.asDictionary();
+    return service && is_vendor_service(*service) ? restriction_entry_for_service(*service) : std::nullopt;
+  });
+}
+
+void removeBlacklisted(Entries& entries, platform::SystemLog& log) {
+  for (const auto& [bundleID, title] : default_blacklist) {
+    const auto row =
+        KELRestrictionListEntry::initWithBundleID(PropertyListString(bundleID), PropertyListString(title));
+    if (std::erase(entries, *row) > 0) continue;
+    log.write("Blacklisted Service '" + std::string(bundleID) + ":" + std::string(title) +
+              "' not found. Perhaps the blacklist needs to be updated?");
+  }
+}
+
+void writeRestrictionsFile(platform::Platform& platform, platform::BytesView bytes, std::ostream& out) {
+  const std::string name = "com.orvex.QVServicesRestrictions.plist";
+  const std::optional<std::string> directory = platform.directories.temporaryDirectory();
+  const std::string path = directory ? platform::joinPath(*directory, name) : name;
+  const std::optional<std::string> error =
+      directory ? platform.files.writePlainly(path, bytes) : "there is no safe temporary directory";
+  if (error) {
+    platform.log.write("Unable to write to path '" + path + "': " + *error);
+  } else {
+    out << "Wrote to " << path << '\n';
+  }
+}
+
+}  // namespace
+
+void generate_whitelist(platform::Platform& platform, std::ostream& out) {
+  if (running_from_launcher(platform.facts)) return;
+  const std::optional<PropertyListValue> publication =
+      platform.preferences.value("com.orvex.ServicesMenu.Services", "QVServices");
+  if (!publication) {
+    out << "No services (com.orvex.ServicesMenu.Services missing or empty in QVServices preferences)\n";
+    return;
+  }
+  KELRestrictionLists lists{vendorServicesOf(*publication), {}};
+  removeBlacklisted(lists.unrestricted, platform.log);
+  const platform::PropertyListWriting writing =
+      platform::writeBinaryPropertyList(*restriction_lists_to_plist(&lists));
+  if (!writing.bytes) {
+    platform.log.write("Unable to construct Services defaults: " + writing.error);
+    return;
+  }
+  writeRestrictionsFile(platform, *writing.bytes, out);
+}
+
+}  // namespace kel
