@@ -1,0 +1,149 @@
+#include "entries/app_entry.h"
+
+#include <sstream>
+#include <utility>
+
+#include "common/debug_sink.h"
+#include "platform/unicode.h"
+
+namespace kel {
+
+namespace {
+
+using platform::PropertyListDictionary;
+using platform::PropertyListDictionaryBuilder;
+using platform::PropertyListString;
+using platform::PropertyListValue;
+
+const PropertyListString bundleIDKey = "bundle_id";
+const PropertyListString nameKey = "name";
+const PropertyListString versionKey = "vers";
+const PropertyListString servicesKey = "service_dicts";
+const PropertyListString menuStringsKey = "loc_to_menu_strings";
+
+KELAppEntry::Value valueUnder(const PropertyListDictionary& dictionary, std::string_view key) {
+  const PropertyListValue* value = dictionary.find(key);
+  return value ? std::optional(*value) : std::nullopt;
+}
+
+bool isFalseMarker(const PropertyListValue& value) { return value.asBoolean() == false; }
+
+}  // namespace
+
+KELAppEntry::KELAppEntry(platform::Platform& platform, std::string bundlePath)
+    : platform_(platform),
+      bundlePath_(std::move(bundlePath)),
+      app_id_(platform::md5(platform::utf16LittleEndianWithMark(bundlePath_.text()))) {}
+
+std::shared_ptr<KELAppEntry> KELAppEntry::initWithBundlePath(platform::Platform& platform,
+                                                             std::string bundlePath) {
+  return std::shared_ptr<KELAppEntry>(new KELAppEntry(platform, std::move(bundlePath)));
+}
+
+std::shared_ptr<KELAppEntry> KELAppEntry::initFromCacheRepresentation(platform::Platform& platform,
+                                                                      const Value& representation,
+                                                                      std::string bundlePath) {
+  const PropertyListDictionary* fields = representation ? representation->asDictionary() : nullptr;
+  if (!fields) return nullptr;
+  auto entry = initWithBundlePath(platform, std::move(bundlePath));
+  entry->setBundleID(valueUnder(*fields, bundleIDKey.text()));
+  entry->setBundleName(valueUnder(*fields, nameKey.text()));
+  entry->setBundleVersion(valueUnder(*fields, versionKey.text()));
+  entry->setInfoPlistServiceDictionaries(valueUnder(*fields, servicesKey.text()));
+  entry->setLocalizationToMenuStrings(valueUnder(*fields, menuStringsKey.text()));
+  return entry;
+}
+
+PropertyListDictionary KELAppEntry::cacheRepresentation() const {
+  std::vector<PropertyListDictionary::Entry> fields;
+  const auto add = [&](const PropertyListString& key, const Value& value) {
+    if (value) fields.emplace_back(key, *value);
+  };
+  add(bundleIDKey, bundleID());
+  add(nameKey, bundleName());
+  add(versionKey, bundleVersion());
+  add(servicesKey, infoPlistServiceDictionaries());
+  add(menuStringsKey, localizationToMenuStrings());
+  return PropertyListDictionary(std::move(fields));
+}
+
+std::string KELAppEntry::description() const {
+  std::ostringstream text;
+  text << "<KELAppEntry: " << static_cast<const void*>(this) << '>';
+  return text.str();
+}
+
+std::unique_ptr<platform::Bundle> KELAppEntry::createBundle() const {
+  return platform_.bundles.open(bundlePath());
+}
+
+void KELAppEntry::refreshCache() {
+  if (servicesCacheIsValid_) return;
+  const std::unique_ptr<platform::Bundle> bundle = createBundle();
+  if (!bundle) {
+    send_debug_line([&] { return "Unable to create a bundle for path " + bundlePath() + ", skipping it"; });
+    return;
+  }
+  if (loadFromBundle(bundle.get())) servicesCacheIsValid_ = true;
+}
+
+bool KELAppEntry::loadFromBundle(platform::Bundle* bundle) {
+  send_debug_line([&] { return "Loading Services from path " + bundlePath(); });
+  if (!bundle) return false;
+  Value identifier = bundle->identifier();
+  const PropertyListDictionary information = bundle->informationDictionary();
+  Value name = valueUnder(information, "KTBundleName");
+  Value version = valueUnder(information, "KTBundleVersion");
+  Value services = valueUnder(information, "QVServices");
+
+  const bool unchanged = identifier == bundleID() && name == bundleName() && version == bundleVersion() &&
+                         services == infoPlistServiceDictionaries();
+  if (!unchanged) setLocalizationToMenuStrings(std::nullopt);
+  setBundleID(std::move(identifier));
+  setBundleName(std::move(name));
+  setBundleVersion(std::move(version));
+  setInfoPlistServiceDictionaries(std::move(services));
+  return validateEntryPlistFormatOptionallyLoggingErrors(true);
+}
+
+void KELAppEntry::loadLocalizations(const std::vector<std::string>& localizations) {
+  const Value current = localizationToMenuStrings();
+  // A cached value of another kind holds no tables; the first lookup replaces it.
+  const PropertyListDictionary* known = current ? current->asDictionary() : nullptr;
+  PropertyListDictionaryBuilder tables;
+  std::unique_ptr<platform::Bundle> bundle;
+  for (const std::string& localization : localizations) {
+    const PropertyListValue* earlier = known ? known->find(localization) : nullptr;
+    if (earlier) {
+      if (!isFalseMarker(*earlier)) break;
+      continue;
+    }
+    if (!bundle && !(bundle = createBundle())) break;
+    PropertyListValue found = lookUpMenuStrings(*bundle, localization);
+    tables.set(localization, found);
+    if (!isFalseMarker(found)) break;
+  }
+  if (tables.size() == 0) return;
+  if (known) {
+    for (const auto& [localization, table] : *known) tables.set(localization, table);
+  }
+  setLocalizationToMenuStrings(tables.build());
+}
+
+/// The strings table of the bundle for `localization`, or false when it has no usable one.
+PropertyListValue KELAppEntry::lookUpMenuStrings(platform::Bundle& bundle,
+                                                 const std::string& localization) const {
+  if (const auto path = bundle.resourcePath("ServicesMenu", "strings", localization)) {
+    platform::DictionaryReading reading = platform::readDictionaryFile(
+        platform_.files, *path, platform::largestForeignFile, platform::bundleFileLimits);
+    if (reading.dictionary) {
+      send_debug_line([&] { return "Read localization " + localization + " in app " + bundlePath(); });
+      return *std::move(reading.dictionary);
+    }
+    send_debug_line([&] { return "Unable to read strings file " + *path; });
+  }
+  send_debug_line([&] { return "No entry for localization " + localization + " in app " + bundlePath(); });
+  return false;
+}
+
+}  // namespace kel

@@ -1,0 +1,235 @@
+#include <algorithm>
+#include <array>
+#include <map>
+#include <stdexcept>
+#include <utility>
+
+#include "common/service_keys.h"
+#include "entries/app_entry.h"
+#include "platform/unicode.h"
+
+namespace kel {
+
+namespace {
+
+using platform::PropertyListArray;
+using platform::PropertyListDictionary;
+using platform::PropertyListDictionaryBuilder;
+using platform::PropertyListString;
+using platform::PropertyListValue;
+
+/// A value of a kind that a public dictionary cannot be made from.
+struct UnusableValue : std::runtime_error {
+  using std::runtime_error::runtime_error;
+};
+
+/// `key` without spaces and tabs, in lower case. Absent for a key so long that it cannot be a known one.
+std::optional<std::string> normalisedKey(std::string_view key) {
+  // The longest known key has 25 letters, and the lower case of a character of more than three bytes is never
+  // an ASCII letter.
+  constexpr std::size_t longest = 3 * std::string_view("qvsupportsfiletranslation").size();
+  std::string result;
+  for (const char c : key) {
+    if (c == ' ' || c == '\t') continue;
+    if (result.size() == longest) return std::nullopt;
+    result += c;
+  }
+  return platform::lowerCase(result);
+}
+
+/// A declared service by normalised keys. Borrows its values.
+class DeclaredService {
+ public:
+  explicit DeclaredService(const PropertyListDictionary& declared) {
+    for (const auto& [key, value] : declared) {
+      if (std::optional<std::string> normalised = normalisedKey(key.text()))
+        values_.emplace(*std::move(normalised), &value);
+    }
+  }
+
+  /// The declared value, or null.
+  const PropertyListValue* find(std::string_view normalisedKey) const {
+    const auto found = values_.find(normalisedKey);
+    return found == values_.end() ? nullptr : found->second;
+  }
+
+ private:
+  // Ordered, not hashed: keys are the bundle's choice.
+  std::map<std::string, const PropertyListValue*, std::less<>> values_;
+};
+
+bool isAnything(const PropertyListValue&) { return true; }
+bool isString(const PropertyListValue& value) { return value.asString() != nullptr; }
+bool isArray(const PropertyListValue& value) { return value.asArray() != nullptr; }
+
+/// A key whose value is carried over when it passes a test.
+struct CarriedKey {
+  std::string_view declared;
+  const PropertyListString& published;
+  bool (*test)(const PropertyListValue&);
+};
+
+const std::array<CarriedKey, 9> carriedKeys{{
+    {"qvportname", service_key::portName, isString},
+    {"qvinputmechanism", service_key::inputMechanism, isAnything},
+    {"qvhost", service_key::host, isString},
+    {"qvrequiredcontext", service_key::requiredContext, isAnything},
+    {"qvforbiddencontext", service_key::forbiddenContext, isAnything},
+    {"qvuserdata", service_key::userData, isString},
+    {"qvtimeout", service_key::timeout, isAnything},
+    {"qvsendfiletypes", service_key::sendFileTypes, isAnything},
+    {"qvreturntypes", service_key::returnTypes, isArray},
+}};
+
+void carryOver(const DeclaredService& declared, const CarriedKey& key,
+               PropertyListDictionaryBuilder& service) {
+  const PropertyListValue* value = declared.find(key.declared);
+  if (value && key.test(*value)) service.set(key.published, *value);
+}
+
+void addKindAndMessage(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
+  const PropertyListValue* message = nullptr;
+  if ((message = declared.find("qvspellchecker"))) {
+    service.set(service_key::spellChecker, *message);
+  } else if ((message = declared.find("qvfilter"))) {
+    service.set(service_key::filter, *message);
+    carryOver(declared, {"qvsupportsfiletranslation", service_key::supportsFileTranslation, isAnything},
+              service);
+    carryOver(declared, {"qvsupportsdatatranslation", service_key::supportsDataTranslation, isAnything},
+              service);
+  } else {
+    message = declared.find("qvmessage");
+  }
+  if (message && isString(*message)) service.set(service_key::message, *message);
+}
+
+void addSendTypesOrLanguages(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
+  // Send types of the wrong kind hide the languages too.
+  if (declared.find("qvsendtypes")) {
+    carryOver(declared, {"qvsendtypes", service_key::sendTypes, isArray}, service);
+  } else {
+    carryOver(declared, {"qvlanguages", service_key::languages, isArray}, service);
+  }
+}
+
+PropertyListDictionaryBuilder declaredTitles(const PropertyListValue* declared, bool keepEmpty) {
+  PropertyListDictionaryBuilder titles;
+  if (!declared) return titles;
+  if (isString(*declared)) {
+    titles.set(service_key::defaultTitle, *declared);
+  } else if (const PropertyListDictionary* pairs = declared->asDictionary()) {
+    for (const auto& [localization, title] : *pairs) {
+      const std::string* text = title.asString();
+      if (text && (keepEmpty || !text->empty())) titles.set(localization, title);
+    }
+  }
+  return titles;
+}
+
+bool textAsBoolean(std::string_view text) {
+  const auto dropLeading = [&](std::string_view characters) {
+    text.remove_prefix(std::min(text.find_first_not_of(characters), text.size()));
+  };
+  dropLeading(" \t\n\v\f\r");
+  if (text.starts_with('+') || text.starts_with('-')) text.remove_prefix(1);
+  dropLeading("0");
+  return !text.empty() && std::string_view("YyTt123456789").find(text.front()) != std::string_view::npos;
+}
+
+bool asBoolean(const PropertyListValue& value) {
+  if (const std::string* text = value.asString()) return textAsBoolean(*text);
+  if (const auto boolean = value.asBoolean()) return *boolean;
+  if (const auto integer = value.asInteger()) return integer->bits != 0;
+  if (const auto real = value.asReal()) return *real != 0;
+  return true;
+}
+
+platform::Bytes serviceUUID(const platform::Digest& key, std::uint32_t index) {
+  std::array<std::uint8_t, 4> littleEndian{};
+  for (std::size_t i = 0; i < littleEndian.size(); ++i)
+    littleEndian[i] = static_cast<std::uint8_t>(index >> (8 * i));
+  const platform::Digest digest = platform::hmacMD5(key, littleEndian);
+  return platform::Bytes(digest.begin(), digest.end());
+}
+
+}  // namespace
+
+/// The strings tables of an entry without the markers of localizations that have none: a client may have
+/// asked for many of those, and every service goes through what is left.
+struct KELAppEntry::MenuStringsTables {
+  explicit MenuStringsTables(const Value& localizationToMenuStrings) {
+    if (!localizationToMenuStrings) return;
+    const PropertyListDictionary* all = localizationToMenuStrings->asDictionary();
+    if (!all) {
+      failure = "the localized menu strings are no dictionary";
+      return;
+    }
+    for (const auto& [localization, value] : *all) {
+      if (value.asDictionary()) {
+        tables.emplace_back(localization, value);
+      } else if (value.asBoolean() != false) {
+        failure =
+            "the menu strings of localization " + localization.text() + " are neither a table nor false";
+      }
+    }
+  }
+
+  std::vector<PropertyListDictionary::Entry> tables;
+  std::string failure;  ///< why the tables cannot be applied; empty when they can
+};
+
+PropertyListDictionaryBuilder KELAppEntry::transformServiceDictionaryForPlist(
+    const PropertyListValue& declaredService, std::uint32_t index, const MenuStringsTables& tables) const {
+  const PropertyListDictionary* dictionary = declaredService.asDictionary();
+  if (!dictionary) throw UnusableValue("service " + std::to_string(index) + " is no dictionary");
+  const DeclaredService declared(*dictionary);
+
+  PropertyListDictionaryBuilder service;
+  addKindAndMessage(declared, service);
+  service.set(service_key::bundlePath, bundlePath_);
+  if (Value identifier = bundleID()) service.set(service_key::bundleIdentifier, *std::move(identifier));
+  for (const CarriedKey& key : carriedKeys) carryOver(declared, key, service);
+  addSendTypesOrLanguages(declared, service);
+  if (const PropertyListValue* restricted = declared.find("qvrestricted"))
+    service.set(service_key::restricted, asBoolean(*restricted));
+
+  PropertyListDictionaryBuilder titles = declaredTitles(declared.find("qvmenuitem"), true);
+  PropertyListDictionaryBuilder keyEquivalents = declaredTitles(declared.find("qvkeyequivalent"), false);
+  applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(titles, tables);
+  applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(keyEquivalents, tables);
+  service.set(service_key::menuItem, titles.build());
+  service.set(service_key::keyEquivalent, keyEquivalents.build());
+  service.set(service_key::uuid, serviceUUID(app_id_, index));
+  return service;
+}
+
+void KELAppEntry::applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(
+    PropertyListDictionaryBuilder& titles, const MenuStringsTables& tables) {
+  const PropertyListValue* found = titles.find(service_key::defaultTitle);
+  if (!found) return;
+  if (!tables.failure.empty()) throw UnusableValue(tables.failure);
+  // A copy: a localization may itself be called "default".
+  const PropertyListString defaultTitle = *found->asSharedString();
+  for (const auto& [localization, table] : tables.tables) {
+    if (const PropertyListValue* translation = table.asDictionary()->find(defaultTitle.text()))
+      titles.set(localization, *translation);
+  }
+}
+
+void KELAppEntry::addPublicDictionariesForServices(
+    std::vector<PropertyListDictionaryBuilder>& services) const {
+  const Value declared = infoPlistServiceDictionaries();
+  if (!declared) return;
+  try {
+    const PropertyListArray* declaredServices = declared->asArray();
+    if (!declaredServices) throw UnusableValue("the declared services are no array");
+    const MenuStringsTables tables(localizationToMenuStrings());
+    std::uint32_t index = 0;
+    for (const PropertyListValue& service : *declaredServices)
+      services.push_back(transformServiceDictionaryForPlist(service, index++, tables));
+  } catch (const UnusableValue& failure) {
+    platform_.log.write("Exception processing Services at path " + bundlePath() + ": " + failure.what());
+  }
+}
+
+}  // namespace kel
