@@ -4,34 +4,34 @@
 
 /// Keys of service dictionaries. Each is one shared string, so that storing a value under it copies a
 /// reference and a list of many services holds each key once.
-namespace kel::service_key {
+namespace kel::service_keys {
 
 using Key = platform::PropertyListString;
 
-inline const Key bundleIdentifier = "QVBundleIdentifier";
-inline const Key bundlePath = "QVBundlePath";
-inline const Key filter = "QVFilter";
-inline const Key forbiddenContext = "QVForbiddenContext";
-inline const Key host = "QVHost";
-inline const Key inputMechanism = "QVInputMechanism";
-inline const Key keyEquivalent = "QVKeyEquivalent";
-inline const Key languages = "QVLanguages";
-inline const Key menuItem = "QVMenuItem";
-inline const Key message = "QVMessage";
-inline const Key portName = "QVPortName";
-inline const Key requiredContext = "QVRequiredContext";
-inline const Key restricted = "QVRestricted";
-inline const Key returnTypes = "QVReturnTypes";
-inline const Key sendFileTypes = "QVSendFileTypes";
-inline const Key sendTypes = "QVSendTypes";
-inline const Key spellChecker = "QVSpellChecker";
-inline const Key supportsDataTranslation = "QVSupportsDataTranslation";
-inline const Key supportsFileTranslation = "QVSupportsFileTranslation";
-inline const Key timeout = "QVTimeout";
-inline const Key userData = "QVUserData";
-inline const Key uuid = "QVUUID";
+inline const Key QVBundleIdentifier = "QVBundleIdentifier";
+inline const Key QVBundlePath = "QVBundlePath";
+inline const Key QVFilter = "QVFilter";
+inline const Key QVForbiddenContext = "QVForbiddenContext";
+inline const Key QVHost = "QVHost";
+inline const Key QVInputMechanism = "QVInputMechanism";
+inline const Key QVKeyEquivalent = "QVKeyEquivalent";
+inline const Key QVLanguages = "QVLanguages";
+inline const Key QVMenuItem = "QVMenuItem";
+inline const Key QVMessage = "QVMessage";
+inline const Key QVPortName = "QVPortName";
+inline const Key QVRequiredContext = "QVRequiredContext";
+inline const Key QVRestricted = "QVRestricted";
+inline const Key QVReturnTypes = "QVReturnTypes";
+inline const Key QVSendFileTypes = "QVSendFileTypes";
+inline const Key QVSendTypes = "QVSendTypes";
+inline const Key QVSpellChecker = "QVSpellChecker";
+inline const Key QVSupportsDataTranslation = "QVSupportsDataTranslation";
+inline const Key QVSupportsFileTranslation = "QVSupportsFileTranslation";
+inline const Key QVTimeout = "QVTimeout";
+inline const Key QVUserData = "QVUserData";
+inline const Key QVUUID = "QVUUID";
 
 /// In a dictionary of menu titles or key equivalents: the one that is not localized.
 inline const Key defaultTitle = "default";
 
-}  // namespace kel::service_key
+}  // namespace kel::service_keys

@@ -98,7 +98,7 @@ bool KELAppEntry::loadFromBundle(platform::Bundle* bundle) {
 
   const bool unchanged = identifier == bundleID() && name == bundleName() && version == bundleVersion() &&
                          services == infoPlistServiceDictionaries();
-  if (!unchanged) setLocalizationToMenuStrings(std::nullopt);
+  if (!unchanged) localizationToMenuStrings_.with([](Value& strings) { strings.reset(); });
   setBundleID(std::move(identifier));
   setBundleName(std::move(name));
   setBundleVersion(std::move(version));

@@ -70,15 +70,15 @@ struct CarriedKey {
 };
 
 const std::array<CarriedKey, 9> carriedKeys{{
-    {"qvportname", service_key::portName, isString},
-    {"qvinputmechanism", service_key::inputMechanism, isAnything},
-    {"qvhost", service_key::host, isString},
-    {"qvrequiredcontext", service_key::requiredContext, isAnything},
-    {"qvforbiddencontext", service_key::forbiddenContext, isAnything},
-    {"qvuserdata", service_key::userData, isString},
-    {"qvtimeout", service_key::timeout, isAnything},
-    {"qvsendfiletypes", service_key::sendFileTypes, isAnything},
-    {"qvreturntypes", service_key::returnTypes, isArray},
+    {"qvportname", service_keys::QVPortName, isString},
+    {"qvinputmechanism", service_keys::QVInputMechanism, isAnything},
+    {"qvhost", service_keys::QVHost, isString},
+    {"qvrequiredcontext", service_keys::QVRequiredContext, isAnything},
+    {"qvforbiddencontext", service_keys::QVForbiddenContext, isAnything},
+    {"qvuserdata", service_keys::QVUserData, isString},
+    {"qvtimeout", service_keys::QVTimeout, isAnything},
+    {"qvsendfiletypes", service_keys::QVSendFileTypes, isAnything},
+    {"qvreturntypes", service_keys::QVReturnTypes, isArray},
 }};
 
 void carryOver(const DeclaredService& declared, const CarriedKey& key,
@@ -90,25 +90,25 @@ void carryOver(const DeclaredService& declared, const CarriedKey& key,
 void addKindAndMessage(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
   const PropertyListValue* message = nullptr;
   if ((message = declared.find("qvspellchecker"))) {
-    service.set(service_key::spellChecker, *message);
+    service.set(service_keys::QVSpellChecker, *message);
   } else if ((message = declared.find("qvfilter"))) {
-    service.set(service_key::filter, *message);
-    carryOver(declared, {"qvsupportsfiletranslation", service_key::supportsFileTranslation, isAnything},
+    service.set(service_keys::QVFilter, *message);
+    carryOver(declared, {"qvsupportsfiletranslation", service_keys::QVSupportsFileTranslation, isAnything},
               service);
-    carryOver(declared, {"qvsupportsdatatranslation", service_key::supportsDataTranslation, isAnything},
+    carryOver(declared, {"qvsupportsdatatranslation", service_keys::QVSupportsDataTranslation, isAnything},
               service);
   } else {
     message = declared.find("qvmessage");
   }
-  if (message && isString(*message)) service.set(service_key::message, *message);
+  if (message && isString(*message)) service.set(service_keys::QVMessage, *message);
 }
 
 void addSendTypesOrLanguages(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
   // Send types of the wrong kind hide the languages too.
   if (declared.find("qvsendtypes")) {
-    carryOver(declared, {"qvsendtypes", service_key::sendTypes, isArray}, service);
+    carryOver(declared, {"qvsendtypes", service_keys::QVSendTypes, isArray}, service);
   } else {
-    carryOver(declared, {"qvlanguages", service_key::languages, isArray}, service);
+    carryOver(declared, {"qvlanguages", service_keys::QVLanguages, isArray}, service);
   }
 }
 
@@ -116,7 +116,7 @@ PropertyListDictionaryBuilder declaredTitles(const PropertyListValue* declared, 
   PropertyListDictionaryBuilder titles;
   if (!declared) return titles;
   if (isString(*declared)) {
-    titles.set(service_key::defaultTitle, *declared);
+    titles.set(service_keys::defaultTitle, *declared);
   } else if (const PropertyListDictionary* pairs = declared->asDictionary()) {
     for (const auto& [localization, title] : *pairs) {
       const std::string* text = title.asString();
@@ -186,26 +186,26 @@ PropertyListDictionaryBuilder KELAppEntry::transformServiceDictionaryForPlist(
 
   PropertyListDictionaryBuilder service;
   addKindAndMessage(declared, service);
-  service.set(service_key::bundlePath, bundlePath_);
-  if (Value identifier = bundleID()) service.set(service_key::bundleIdentifier, *std::move(identifier));
+  service.set(service_keys::QVBundlePath, bundlePath_);
+  if (Value identifier = bundleID()) service.set(service_keys::QVBundleIdentifier, *std::move(identifier));
   for (const CarriedKey& key : carriedKeys) carryOver(declared, key, service);
   addSendTypesOrLanguages(declared, service);
   if (const PropertyListValue* restricted = declared.find("qvrestricted"))
-    service.set(service_key::restricted, asBoolean(*restricted));
+    service.set(service_keys::QVRestricted, asBoolean(*restricted));
 
   PropertyListDictionaryBuilder titles = declaredTitles(declared.find("qvmenuitem"), true);
   PropertyListDictionaryBuilder keyEquivalents = declaredTitles(declared.find("qvkeyequivalent"), false);
   applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(titles, tables);
   applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(keyEquivalents, tables);
-  service.set(service_key::menuItem, titles.build());
-  service.set(service_key::keyEquivalent, keyEquivalents.build());
-  service.set(service_key::uuid, serviceUUID(app_id_, index));
+  service.set(service_keys::QVMenuItem, titles.build());
+  service.set(service_keys::QVKeyEquivalent, keyEquivalents.build());
+  service.set(service_keys::QVUUID, serviceUUID(app_id_, index));
   return service;
 }
 
 void KELAppEntry::applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(
     PropertyListDictionaryBuilder& titles, const MenuStringsTables& tables) {
-  const PropertyListValue* found = titles.find(service_key::defaultTitle);
+  const PropertyListValue* found = titles.find(service_keys::defaultTitle);
   if (!found) return;
   if (!tables.failure.empty()) throw UnusableValue(tables.failure);
   // A copy: a localization may itself be called "default".

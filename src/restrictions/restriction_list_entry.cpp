@@ -38,11 +38,11 @@ std::optional<KELRestrictionListEntry> KELRestrictionListEntry::initWithDictiona
     const PropertyListValue& representation) {
   const PropertyListDictionary* row = representation.asDictionary();
   if (!row) return std::nullopt;
-  return initWithBundleID(stringUnder(*row, bundleIDKey), stringUnder(*row, service_key::menuItem));
+  return initWithBundleID(stringUnder(*row, bundleIDKey), stringUnder(*row, service_keys::QVMenuItem));
 }
 
 PropertyListDictionary KELRestrictionListEntry::dictionaryRepresentation() const {
-  return PropertyListDictionary({{bundleIDKey, bundleID_}, {service_key::menuItem, title_}});
+  return PropertyListDictionary({{bundleIDKey, bundleID_}, {service_keys::QVMenuItem, title_}});
 }
 
 std::size_t KELRestrictionListEntry::hash() const { return std::hash<std::string>{}(title_.text()); }

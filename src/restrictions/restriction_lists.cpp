@@ -71,29 +71,29 @@ void apply_restriction_lists(std::vector<PropertyListDictionaryBuilder>& service
     restricted.insert(lists->restricted.begin(), lists->restricted.end());
   }
   for (PropertyListDictionaryBuilder& service : services) {
-    if (service.find(service_key::restricted)) continue;
+    if (service.find(service_keys::QVRestricted)) continue;
     const std::optional<KELRestrictionListEntry> entry = restriction_entry_for_service(service);
     if (!entry) continue;
     if (restricted.contains(*entry) || (is_vendor_service(service) && !unrestricted.contains(*entry))) {
-      service.set(service_key::restricted, true);
+      service.set(service_keys::QVRestricted, true);
     }
   }
 }
 
 bool is_vendor_service(const ServiceView& service) {
-  const PropertyListValue* identifier = service.find(service_key::bundleIdentifier);
+  const PropertyListValue* identifier = service.find(service_keys::QVBundleIdentifier);
   const std::string* text = identifier ? identifier->asString() : nullptr;
   return text && text->starts_with("com.orvex.");
 }
 
 std::optional<KELRestrictionListEntry> restriction_entry_for_service(const ServiceView& service) {
-  const PropertyListValue* menuItem = service.find(service_key::menuItem);
+  const PropertyListValue* menuItem = service.find(service_keys::QVMenuItem);
   const PropertyListDictionary* titles = menuItem ? menuItem->asDictionary() : nullptr;
   if (!titles) return std::nullopt;
-  std::optional<PropertyListString> title = sharedString(titles->find(service_key::defaultTitle.text()));
+  std::optional<PropertyListString> title = sharedString(titles->find(service_keys::defaultTitle.text()));
   if (!title) title = sharedString(titles->find("English"));
-  return KELRestrictionListEntry::initWithBundleID(sharedString(service.find(service_key::bundleIdentifier)),
-                                                   std::move(title));
+  return KELRestrictionListEntry::initWithBundleID(
+      sharedString(service.find(service_keys::QVBundleIdentifier)), std::move(title));
 }
 
 }  // namespace kel
