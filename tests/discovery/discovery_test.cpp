@@ -1,0 +1,162 @@
+#include <gmock/gmock.h>
+#include <thread>
+
+#include "discovery/path_change_observation_request.h"
+#include "discovery/path_changes_observer.h"
+#include "discovery/services_provider_locator.h"
+#include "support/debug_lines.h"
+#include "support/in_memory_files.h"
+#include "support/in_memory_services.h"
+#include "support/manual_clock.h"
+
+namespace kel {
+namespace {
+
+using test::debugLines;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using Paths = std::vector<std::string>;
+
+constexpr std::uint32_t mustScan = platform::event_flags::mustScanSubDirectories;
+constexpr std::uint32_t wrapped = platform::event_flags::eventIDsWrapped;
+
+TEST(ServicesProviderLocatorTest, ListsOnceKeepsVisibleEntriesOfEveryKindAndMissingDirectoriesAsEmpty) {
+  test::InMemoryFileSystem files;
+  files.addDirectory("/A/Services/x.service");
+  files.addText("/A/Services/.hidden", "");
+  files.addText("/A/Services/notes.txt", "");
+  for (const std::string base : {"/A/Services/", "/A/Services"}) {
+    KELServicesProviderLocator locator(files, base);
+    EXPECT_EQ(debugLines([&] { locator.refreshCache(); }), "Scanning directory: " + base);
+    EXPECT_THAT(locator.paths(), ElementsAre("/A/Services/notes.txt", "/A/Services/x.service"));
+    files.addDirectory("/A/Services/later.service");
+    EXPECT_EQ(debugLines([&] { locator.refreshCache(); }), "Cache valid for directory " + base);
+    EXPECT_THAT(locator.paths(), testing::SizeIs(2)) << "a valid listing was read again";
+    files.removeTree("/A/Services/later.service");
+  }
+  KELServicesProviderLocator missing(files, "/none/");
+  missing.paths().insert("/none/restored");
+  EXPECT_EQ(debugLines([&] { missing.refreshCache(); }), "Scanning directory: /none/");
+  EXPECT_THAT(missing.paths(), IsEmpty());
+  EXPECT_TRUE(missing.directoryContentsCacheIsValid());
+}
+
+class PathChangesObserverTest : public testing::Test {
+ protected:
+  /// Observes and returns the debug lines; afterwards no stream is open.
+  std::string observe(const Paths& paths) {
+    std::string lines = debugLines([&] { observer.observeChangesUnderPaths(paths); });
+    EXPECT_EQ(journal.liveStreams, 0) << "a stream outlived its request";
+    return lines;
+  }
+
+  test::InMemoryJournal journal;
+  test::ManualClock clock;
+  KELPathChangesObserver observer{journal, clock, journal.currentEventID()};
+};
+
+TEST_F(PathChangesObserverTest, ChangesInsideADirectoryAreUnderItAndLeaveItselfUnchanged) {
+  journal.record("/A/Services/x.service/");
+  EXPECT_EQ(observe({"/A/Services/"}),
+            "Looking for changes under paths:\n\t/A/Services/\nChanged subpaths:\n\t/A/Services/x.service/");
+  EXPECT_FALSE(observer.pathChangedOrRequiresRescan("/A/Services/"));
+  EXPECT_THAT(observer.changedPathsUnderPath("/A/Services/"), ElementsAre("/A/Services/x.service/"));
+  EXPECT_THAT(observer.changedPathsUnderPath("/A/Services/y.service"), IsEmpty());
+  ASSERT_EQ(journal.creations.size(), 1U);
+  EXPECT_EQ(journal.creations[0].since, 1000U);
+  EXPECT_EQ(journal.creations[0].flags, 5U);
+}
+
+TEST_F(PathChangesObserverTest, PrefixTestsAreThoseOfStrings) {
+  journal.record("/A/");
+  journal.record("/B/x");
+  observe({"/A/Services/", "/B/x.app"});
+  for (const auto& [path, changed] : std::vector<std::pair<std::string, bool>>{
+           {"/A/x.app", true}, {"/A/Services/", true}, {"/B/x.app", true}, {"/B/", false}, {"/A", false}}) {
+    EXPECT_EQ(observer.pathChangedOrRequiresRescan(path), changed) << path;
+  }
+}
+
+TEST_F(PathChangesObserverTest, WhatAnEarlierCallCoveredIsNotAskedAgain) {
+  EXPECT_EQ(observe({}), "");
+  EXPECT_EQ(observe({"/A/Services/x.service"}),
+            "Looking for changes under paths:\n\t/A/Services/x.service\nNo changes!");
+  EXPECT_EQ(observe({"/A/Services/", "/A/Services/x.service"}),
+            "Looking for changes under paths:\n\t/A/Services/\nNo changes!");
+  EXPECT_EQ(observe({"/A/Services/x.service", "/A/Services/y.service"}), "");
+  EXPECT_EQ(journal.creations.size(), 2U);
+}
+
+TEST_F(PathChangesObserverTest, AFullScanNeedCountsForThePathsAskedAndNotForThoseTheEventsName) {
+  struct Case {
+    const char* name;
+    std::uint32_t flags;
+  };
+  for (const Case& c :
+       {Case{"must scan", mustScan}, Case{"wrapped", wrapped}, Case{"both", mustScan | wrapped}}) {
+    test::InMemoryJournal ownJournal;
+    KELPathChangesObserver own(ownJournal, clock, 1000);
+    ownJournal.record("/A/Services/z", c.flags);
+    ownJournal.record("/A/Services/y");
+    EXPECT_EQ(debugLines([&] { own.observeChangesUnderPaths({"/A/Services/"}); }),
+              "Looking for changes under paths:\n\t/A/Services/\nVigil says we must do a full scan")
+        << c.name;
+    EXPECT_TRUE(own.pathChangedOrRequiresRescan("/A/Services/q")) << c.name;
+    EXPECT_THAT(own.changedPathsUnderPath("/A/"), ElementsAre("/A/Services/")) << c.name;
+    EXPECT_THAT(own.changedPathsUnderPath("/A/Services/"), ElementsAre("/A/Services/")) << c.name;
+    EXPECT_THAT(own.changedPathsUnderPath("/A/Services/y"), IsEmpty()) << c.name;
+  }
+}
+
+TEST_F(PathChangesObserverTest, WithoutAStreamEverythingAskedNeedsAFullScan) {
+  journal.available = false;
+  EXPECT_EQ(observe({"/A/"}), "Looking for changes under paths:\n\t/A/\nVigilStream failed!");
+  journal.available = true;
+  journal.refuseStart = true;
+  EXPECT_EQ(observe({"/B/"}), "Looking for changes under paths:\n\t/B/\nVigilStream failed!");
+  EXPECT_TRUE(observer.pathChangedOrRequiresRescan("/A/x"));
+  EXPECT_TRUE(observer.pathChangedOrRequiresRescan("/B/"));
+  EXPECT_EQ(observe({"/A/x"}), "") << "a path in need of a scan counts as observed";
+}
+
+TEST_F(PathChangesObserverTest, AJournalThatCannotWatchRootsIsAskedWithout) {
+  journal.refuseWatchRoot = true;
+  journal.record("/A/x");
+  EXPECT_EQ(observe({"/A/"}), "Looking for changes under paths:\n\t/A/\nChanged subpaths:\n\t/A/x");
+  ASSERT_EQ(journal.creations.size(), 2U);
+  EXPECT_EQ(journal.creations[0].flags, 5U);
+  EXPECT_EQ(journal.creations[1].flags, 1U);
+}
+
+TEST_F(PathChangesObserverTest, AReplayThatTakesTooLongSaysNothingAboutItsPaths) {
+  journal.historyEnds = false;
+  journal.record("/A/x");
+  std::string lines;
+  std::thread observing([&] { lines = observe({"/A/"}); });
+  ASSERT_TRUE(clock.awaitWaits(1));
+  clock.advance(std::chrono::seconds(15) - std::chrono::nanoseconds(1));
+  ASSERT_TRUE(clock.awaitWaits(1)) << "gave up before 15 seconds";
+  clock.advance(std::chrono::nanoseconds(1));
+  observing.join();
+  EXPECT_EQ(lines, "Looking for changes under paths:\n\t/A/\nVigil didn't finish after 15 seconds!");
+  EXPECT_FALSE(observer.pathChangedOrRequiresRescan("/A/x"));
+  EXPECT_THAT(observer.changedPathsUnderPath("/A/"), IsEmpty());
+  EXPECT_EQ(observe({"/A/x"}), "") << "the paths count as observed";
+}
+
+TEST_F(PathChangesObserverTest, BatchesAfterTheHistoryAreIgnoredAndSignalNothing) {
+  journal.record("/A/x");
+  journal.afterHistory = {{"/A/late", 0, 2000}, {"/A/z", mustScan, 2001}};
+  const auto request = KELPathChangeObservationRequest::init(journal);
+  ASSERT_TRUE(request->runWithPaths({"/A/"}, 1000));
+  ASSERT_TRUE(request->waiter().wait(std::chrono::seconds(60)));
+  request->stop();
+  EXPECT_THAT(request->changedSubpaths(), ElementsAre("/A/x"));
+  EXPECT_FALSE(request->mustDoFullScan());
+  EXPECT_FALSE(request->waiter().wait(std::chrono::nanoseconds(0)));
+  request->stop();
+  EXPECT_EQ(journal.liveStreams, 0);
+}
+
+}  // namespace
+}  // namespace kel
