@@ -1,0 +1,237 @@
+#include <limits>
+#include <utility>
+
+#include "common/common.h"
+#include "datastore/data_store.h"
+
+namespace kel {
+
+using platform::PropertyListArray;
+using platform::PropertyListDictionary;
+using platform::PropertyListDictionaryBuilder;
+using platform::PropertyListValue;
+
+namespace {
+
+constexpr const char* lastEventIDKey = "QVServicesLastEventID";
+constexpr const char* explicitDirectoryCacheKey = "QVServicesExplicitDirectoryCache";
+constexpr const char* servicesCacheKey = "ServicesCache";
+constexpr const char* restrictionListsKey = "QVServicesRestrictionLists";
+constexpr const char* registryPathsKey = "QVServicesARPaths";
+constexpr const char* sessionIDKey = "QVServicesSessionID";
+constexpr const char* buildVersionKey = "QVServicesBuildVersion";
+
+/// The strings of an array; elements of other kinds are no paths and are passed over.
+std::vector<std::string> stringElements(const PropertyListArray& array) {
+  return map_array(array, [](const PropertyListValue& element) {
+    const std::string* text = element.asString();
+    return text ? std::optional(*text) : std::nullopt;
+  });
+}
+
+PropertyListValue arrayOfStrings(const auto& strings) {
+  return PropertyListArray(strings.begin(), strings.end());
+}
+
+std::string formatted(const char* call, const platform::SystemReading& reading) {
+  return std::string(call) + " failed with errno " + std::to_string(reading.errorNumber) + " (" +
+         reading.errorText + ")";
+}
+
+}  // namespace
+
+const std::string& boot_session_id(platform::Platform& platform) {
+  return platform.constants.bootSessionID.get([&platform] {
+    const platform::SystemReading boot = platform.facts.bootTime();
+    if (!boot.value) send_debug_line([&] { return formatted("sysctlbyname(\"kern.boottime\")", boot); });
+    const platform::SystemReading session = platform.facts.auditSession();
+    if (!session.value) send_debug_line([&] { return formatted("getaudit_addr()", session); });
+    return std::to_string(boot.value.value_or(0)) + "," + std::to_string(session.value.value_or(0));
+  });
+}
+
+const PropertyListValue* typed_value(const PropertyListDictionary& dictionary, std::string_view key,
+                                     ValueKind expected) {
+  const PropertyListValue* value = dictionary.find(key);
+  if (!value) return nullptr;
+  switch (expected) {
+    case ValueKind::Dictionary:
+      return value->asDictionary() ? value : nullptr;
+    case ValueKind::Array:
+      return value->asArray() ? value : nullptr;
+    case ValueKind::String:
+      return value->asString() ? value : nullptr;
+    case ValueKind::Number:
+      return value->isNumber() ? value : nullptr;
+    case ValueKind::Any:
+      return value;
+  }
+  return nullptr;
+}
+
+const PropertyListDictionary* dictionary_value(const PropertyListDictionary& dictionary,
+                                               std::string_view key) {
+  const PropertyListValue* value = typed_value(dictionary, key, ValueKind::Dictionary);
+  return value ? value->asDictionary() : nullptr;
+}
+
+const PropertyListArray* array_value(const PropertyListDictionary& dictionary, std::string_view key) {
+  const PropertyListValue* value = typed_value(dictionary, key, ValueKind::Array);
+  return value ? value->asArray() : nullptr;
+}
+
+std::unique_ptr<KELDataStore> KELDataStore::initWithSystemServices(platform::Platform& platform) {
+  return std::unique_ptr<KELDataStore>(new KELDataStore(platform));
+}
+
+std::optional<std::string> KELDataStore::cacheFilePath() const {
+  return cache_file_path(platform_.directories);
+}
+
+const std::string& KELDataStore::operatingSystemBuildVersion() const {
+  return platform_.constants.buildVersion.get([this] { return platform_.facts.buildVersion(); });
+}
+
+bool KELDataStore::validateCacheDictionaryVersion(const PropertyListDictionary& dictionary) const {
+  const PropertyListValue* version = typed_value(dictionary, buildVersionKey, ValueKind::String);
+  return version && *version->asString() == operatingSystemBuildVersion();
+}
+
+std::optional<PropertyListDictionary> KELDataStore::cacheDictionary() const {
+  const std::optional<std::string> path = cacheFilePath();
+  if (!path) return std::nullopt;
+  platform::DictionaryReading cache =
+      platform::readDictionaryFile(platform_.files, *path, platform::largestOwnFile);
+  if (!cache.dictionary) {
+    send_debug_line([&] {
+      return "Cache at " + *path + " came back nil (file does" +
+             (platform_.files.exists(*path) ? "" : " NOT") + " exist)";
+    });
+    return std::nullopt;
+  }
+  if (!validateCacheDictionaryVersion(*cache.dictionary)) {
+    send_debug_line([] { return "Ignoring cache because it has the wrong version"; });
+    return std::nullopt;
+  }
+  send_debug_line([] { return "Cache read OK"; });
+  return std::move(cache.dictionary);
+}
+
+void KELDataStore::loadCache() {
+  send_debug_line([&] { return "Loading cache from " + cacheFilePath().value_or("(null)"); });
+  const PropertyListDictionary cache = cacheDictionary().value_or(PropertyListDictionary());
+  send_debug_line([&] { return "Cache contains " + std::to_string(cache.size()) + " keys"; });
+
+  if (const PropertyListValue* eventID = typed_value(cache, lastEventIDKey, ValueKind::Number)) {
+    eventStreamID_ = eventID->asUnsigned64().value_or(0);
+    send_debug_line([&] { return "EventStreamID was " + std::to_string(eventStreamID_); });
+  }
+
+  const PropertyListValue* sessionID = typed_value(cache, sessionIDKey, ValueKind::String);
+  cacheSessionID_ = sessionID ? std::optional(*sessionID->asString()) : std::nullopt;
+
+  const PropertyListDictionary* lists = dictionary_value(cache, restrictionListsKey);
+  restrictionLists_ = restriction_lists_from_plist(
+      lists ? std::optional(*lists) : load_restrictions_file(platform_.files, platform_.directories));
+
+  const PropertyListArray* registryPaths = array_value(cache, registryPathsKey);
+  if (registryPaths) {
+    pathsFromAR_ = std::make_shared<const std::vector<std::string>>(stringElements(*registryPaths));
+  }
+  send_debug_line([&] {
+    return std::to_string(registryPaths ? registryPaths->size() : 0) + " path(s) from AppRegistry";
+  });
+
+  const PropertyListDictionary none;
+  const PropertyListDictionary* directories = dictionary_value(cache, explicitDirectoryCacheKey);
+  restoreLocators(directories ? *directories : none);
+  const PropertyListDictionary* entries = dictionary_value(cache, servicesCacheKey);
+  restoreAppEntries(entries ? *entries : none);
+  cacheIsLoaded_ = true;
+}
+
+void KELDataStore::restoreLocators(const PropertyListDictionary& directories) {
+  auto locators = std::make_shared<Locators>();
+  for (const auto& [directory, paths] : directories) {
+    auto locator = std::make_shared<KELServicesProviderLocator>(platform_.files, directory.text());
+    if (const PropertyListArray* array = paths.asArray()) {
+      for (std::string& path : stringElements(*array)) locator->paths().insert(std::move(path));
+    }
+    locator->setDirectoryContentsCacheIsValid(true);
+    locators->emplace(directory.text(), std::move(locator));
+  }
+  pathsToLocators_ = std::move(locators);
+}
+
+void KELDataStore::restoreAppEntries(const PropertyListDictionary& entries) {
+  auto restored = std::make_shared<AppEntries>();
+  for (const auto& [path, representation] : entries) {
+    auto entry = KELAppEntry::initFromCacheRepresentation(platform_, representation, path.text());
+    if (!entry) continue;
+    send_debug_line(
+        [&] { return "Loaded cached entry " + entry->description() + " for path " + path.text(); });
+    entry->setServicesCacheIsValid(true);
+    restored->emplace(path.text(), std::move(entry));
+  }
+  pathsToAppEntries_ = std::move(restored);
+}
+
+PropertyListValue KELDataStore::cacheFileContents() const {
+  PropertyListDictionaryBuilder directories;
+  for (const auto& [directory, locator] : pathsToLocators_ ? *pathsToLocators_ : Locators()) {
+    directories.set(directory, arrayOfStrings(locator->paths()));
+  }
+  PropertyListDictionaryBuilder entries;
+  for (const auto& [path, entry] : pathsToAppEntries_ ? *pathsToAppEntries_ : AppEntries()) {
+    entries.set(path, entry->cacheRepresentation());
+  }
+  PropertyListDictionaryBuilder contents;
+  contents.set(lastEventIDKey, eventStreamID_);
+  contents.set(explicitDirectoryCacheKey, directories.build());
+  contents.set(servicesCacheKey, entries.build());
+  if (const auto lists = restriction_lists_to_plist(restrictionLists_.get()))
+    contents.set(restrictionListsKey, *lists);
+  if (pathsFromAR_) contents.set(registryPathsKey, arrayOfStrings(*pathsFromAR_));
+  contents.set(sessionIDKey, boot_session_id(platform_));
+  contents.set(buildVersionKey, operatingSystemBuildVersion());
+  return contents.build();
+}
+
+void KELDataStore::writeCaches() {
+  auto written = std::make_shared<const platform::PropertyListWriting>(
+      platform::writeBinaryPropertyList(cacheFileContents()));
+  auto work = [&files = platform_.files, path = cacheFilePath(), written] {
+    if (!written->bytes) {
+      send_debug_line([&] { return "Failed to make property list: " + written->error; });
+      return;
+    }
+    const std::optional<std::string> error = path ? files.writeAtomically(*path, *written->bytes)
+                                                  : std::optional<std::string>("no caches directory");
+    send_debug_line([&] {
+      return error ? "Failed to write cache file: " + *error
+                   : "Wrote out cache file (" + std::to_string(written->bytes->size()) + " bytes)";
+    });
+  };
+  writeQueue_.async(
+      [work = std::move(work), sink = current_debug_sink(),
+       transaction = platform::Transaction(platform_.transactions)] { run_with_debug_sink(sink, work); });
+}
+
+bool KELDataStore::cacheIsFromThisBootSession() {
+  if (!cacheIsLoaded_) loadCache();
+  return cacheSessionID_ == boot_session_id(platform_);
+}
+
+void KELDataStore::flushCaches() {
+  restrictionLists_ = nullptr;
+  cacheSessionID_ = std::nullopt;
+  currentPublicDictionaries_ = std::nullopt;
+  pathsToLocators_ = nullptr;
+  pathsToAppEntries_ = nullptr;
+  writeQueue_.sync([this] {
+    if (const std::optional<std::string> path = cacheFilePath()) platform_.files.remove(*path);
+  });
+  cacheIsLoaded_ = false;
+}
+
+}  // namespace kel

@@ -1,0 +1,214 @@
+#include <algorithm>
+#include <unordered_map>
+#include <unordered_set>
+#include <utility>
+
+#include "common/common.h"
+#include "common/path_set.h"
+#include "datastore/data_store.h"
+
+namespace kel {
+
+namespace {
+
+template <typename Map>
+auto mapValues(const Map& map) {
+  std::vector<typename Map::mapped_type> values;
+  values.reserve(map.size());
+  for (const auto& [key, value] : map) values.push_back(value);
+  return values;
+}
+
+/// True when something changed in the directory itself, outside every entry that the locator knows.
+bool changedOutsideKnownPaths(const std::set<std::string>& changedPaths,
+                              const KELServicesProviderLocator& locator) {
+  if (changedPaths.empty()) return false;
+  PathSet known;
+  for (const std::string& path : locator.paths()) known.insert(path);
+  return !std::all_of(changedPaths.begin(), changedPaths.end(),
+                      [&known](const std::string& changed) { return known.holdsPrefixOf(changed); });
+}
+
+bool hasChanged(const std::string& path, KELPathChangesObserver* observer) {
+  return !observer || observer->pathChangedOrRequiresRescan(path) ||
+         !observer->changedPathsUnderPath(path).empty();
+}
+
+}  // namespace
+
+std::vector<std::string> service_providing_paths(platform::Platform& platform) {
+  constexpr std::uint32_t mask = platform::ApplicationRegistry::providesServices;
+  std::vector<std::string> paths =
+      map_array(platform.applications.applications(mask, mask),
+                [](const platform::RegisteredApplication& application) { return application.path; });
+  send_debug_line([&] { return "Service providing paths:\n\t" + join(paths, "\n\t"); });
+  return paths;
+}
+
+std::string parent_directory(std::string_view path) {
+  while (path.size() > 1 && path.ends_with('/')) path.remove_suffix(1);
+  path = path.substr(0, path.rfind('/') + 1);
+  return path.empty() ? "/" : std::string(path);
+}
+
+std::vector<std::string> paths_to_observe(const std::vector<std::string>& paths) {
+  constexpr std::size_t fewestToShareTheirParent = 3;
+  std::unordered_map<std::string, std::size_t> countOfParent;
+  for (const std::string& path : paths) ++countOfParent[parent_directory(path)];
+
+  std::unordered_set<std::string> chosen;
+  for (const std::string& path : paths) {
+    std::string parent = parent_directory(path);
+    chosen.insert(countOfParent[parent] >= fewestToShareTheirParent ? std::move(parent) : path);
+  }
+
+  // An ancestor ends in "/", so an element has one exactly when a shorter element that ends in "/" is its
+  // prefix.
+  PathSet possibleAncestors;
+  for (const std::string& path : chosen) {
+    if (path.ends_with('/')) possibleAncestors.insert(path);
+  }
+  std::vector<std::string> result;
+  for (const std::string& path : chosen) {
+    const std::string* ancestor = possibleAncestors.shortestPrefixOf(path);
+    if (!ancestor || *ancestor == path) result.push_back(path);
+  }
+  return result;
+}
+
+void KELDataStore::updateServicesCache(KELStaleCacheFlags flags) {
+  if (!cacheIsLoaded_) loadCache();
+  flags = widenedFlags(flags);
+  currentPublicDictionaries_ = std::nullopt;
+  const std::shared_ptr<KELPathChangesObserver> observer = readStaleSources(flags);
+
+  std::vector<std::string> unchangedPaths;
+  AppEntries entries = entriesForCandidates(candidatePaths(), unchangedPaths);
+  if (flags & KELStaleServiceDirectories) {
+    if (observer) observer->observeChangesUnderPaths(paths_to_observe(unchangedPaths));
+    for (const auto& [path, entry] : entries) {
+      if (entry->servicesCacheIsValid() && hasChanged(entry->bundlePath(), observer.get())) {
+        entry->setServicesCacheIsValid(false);
+      }
+    }
+  }
+  apply_concurrently(platform_.concurrentQueue, mapValues(entries),
+                     [](const std::shared_ptr<KELAppEntry>& entry) { entry->refreshCache(); });
+  std::erase_if(entries, [](const auto& item) { return !item.second->servicesCacheIsValid(); });
+  pathsToAppEntries_ = std::make_shared<const AppEntries>(std::move(entries));
+}
+
+KELStaleCacheFlags KELDataStore::widenedFlags(KELStaleCacheFlags flags) const {
+  if (!pathsFromAR_ || pathsFromAR_->empty()) flags |= KELStaleAppRegistryPaths;
+  if (!restrictionLists_) flags |= KELStaleRestrictionLists;
+  if (!pathsToLocators_ || pathsToLocators_->empty()) flags |= KELStaleServiceDirectories;
+  return flags;
+}
+
+/// Reads the sources named by `flags` in parallel and installs what they gave. Returns the observer of
+/// changes since the last look at the directories, when they are looked at now and that position is known.
+std::shared_ptr<KELPathChangesObserver> KELDataStore::readStaleSources(KELStaleCacheFlags flags) {
+  std::shared_ptr<KELPathChangesObserver> observer;
+  std::shared_ptr<const Locators> newLocators;
+  std::shared_ptr<const std::vector<std::string>> newRegistryPaths;
+  std::shared_ptr<const KELRestrictionLists> newRestrictionLists;
+
+  platform::Group group;
+  const auto start = [this, &group, sink = current_debug_sink()](std::function<void()> task) {
+    group.async(platform_.concurrentQueue,
+                [sink, task = std::move(task)] { run_with_debug_sink(sink, task); });
+  };
+  if (flags & KELStaleServiceDirectories) {
+    if (eventStreamID_ != 0) {
+      observer = std::make_shared<KELPathChangesObserver>(platform_.journal, platform_.clock, eventStreamID_);
+    }
+    // Taken before any scan starts, so that a change made meanwhile is seen by the next update.
+    eventStreamID_ = platform_.journal.currentEventID();
+    start([&] { newLocators = refreshedLocators(observer.get()); });
+  }
+  if (flags & KELStaleAppRegistryPaths) {
+    start([&] {
+      newRegistryPaths = std::make_shared<const std::vector<std::string>>(service_providing_paths(platform_));
+    });
+  }
+  if (flags & KELStaleRestrictionLists) {
+    start([&] {
+      newRestrictionLists =
+          restriction_lists_from_plist(load_restrictions_file(platform_.files, platform_.directories));
+    });
+  }
+  group.wait();
+
+  if (newLocators) pathsToLocators_ = std::move(newLocators);
+  if (newRegistryPaths) pathsFromAR_ = std::move(newRegistryPaths);
+  if (newRestrictionLists) restrictionLists_ = std::move(newRestrictionLists);
+  return observer;
+}
+
+std::shared_ptr<const KELDataStore::Locators> KELDataStore::refreshedLocators(
+    KELPathChangesObserver* observer) const {
+  std::vector<std::string> unchangedDirectories;
+  auto locators = std::make_shared<Locators>();
+  for (const std::string& directory : explicit_service_directories(platform_.directories)) {
+    std::shared_ptr<KELServicesProviderLocator> locator;
+    if (pathsToLocators_) {
+      if (const auto known = pathsToLocators_->find(directory); known != pathsToLocators_->end()) {
+        locator = known->second;
+      }
+    }
+    if (!locator) {
+      locator = std::make_shared<KELServicesProviderLocator>(platform_.files, directory);
+    } else if (locator->directoryContentsCacheIsValid()) {
+      unchangedDirectories.push_back(directory);
+    }
+    locators->insert_or_assign(directory, std::move(locator));
+  }
+  if (observer) observer->observeChangesUnderPaths(unchangedDirectories);
+
+  for (const auto& [directory, locator] : *locators) {
+    if (!locator->directoryContentsCacheIsValid()) continue;
+    const std::string& base = locator->basePath();
+    if (!observer || observer->pathChangedOrRequiresRescan(base) ||
+        changedOutsideKnownPaths(observer->changedPathsUnderPath(base), *locator)) {
+      locator->setDirectoryContentsCacheIsValid(false);
+    }
+  }
+  apply_concurrently(
+      platform_.concurrentQueue, mapValues(*locators),
+      [](const std::shared_ptr<KELServicesProviderLocator>& locator) { locator->refreshCache(); });
+  return locators;
+}
+
+std::set<std::string> KELDataStore::candidatePaths() const {
+  std::set<std::string> candidates;
+  if (pathsFromAR_) candidates.insert(pathsFromAR_->begin(), pathsFromAR_->end());
+  for (const auto& [directory, locator] : pathsToLocators_ ? *pathsToLocators_ : Locators()) {
+    candidates.insert(locator->paths().begin(), locator->paths().end());
+  }
+  std::erase_if(candidates, [](const std::string& path) {
+    if (path.find(".tqarchive/") == std::string::npos) return false;
+    send_debug_line([&] { return "Skipping file inside .tqarchive: " + path; });
+    return true;
+  });
+  return candidates;
+}
+
+KELDataStore::AppEntries KELDataStore::entriesForCandidates(const std::set<std::string>& candidates,
+                                                            std::vector<std::string>& unchangedPaths) const {
+  AppEntries entries;
+  for (const std::string& path : candidates) {
+    const auto known = pathsToAppEntries_ ? pathsToAppEntries_->find(path) : AppEntries::const_iterator();
+    if (pathsToAppEntries_ && known != pathsToAppEntries_->end()) {
+      send_debug_line([&] { return "Found entry " + known->second->description() + " for path " + path; });
+      if (known->second->servicesCacheIsValid()) unchangedPaths.push_back(path);
+      entries.emplace_hint(entries.end(), path, known->second);
+    } else {
+      auto entry = KELAppEntry::initWithBundlePath(platform_, path);
+      send_debug_line([&] { return "Creating entry " + entry->description() + " for path " + path; });
+      entries.emplace_hint(entries.end(), path, std::move(entry));
+    }
+  }
+  return entries;
+}
+
+}  // namespace kel
