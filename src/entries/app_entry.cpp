@@ -10,6 +10,10 @@ namespace kel {
 
 namespace {
 
+// How many localizations an entry remembers before it forgets that it has looked for further ones in vain: their names
+// come from clients, and there may be any number of them.
+constexpr std::size_t mostRemembered = 256;
+
 using platform::PropertyListDictionary;
 using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListString;
@@ -120,8 +124,11 @@ void KELAppEntry::loadLocalizations(const std::vector<std::string>& localization
     }
     if (!bundle && !(bundle = createBundle())) break;
     PropertyListValue found = lookUpMenuStrings(*bundle, localization);
-    tables.set(localization, found);
-    if (!isFalseMarker(found)) break;
+    const bool usable = !isFalseMarker(found);
+    if (usable || tables.size() + (known ? known->size() : 0) < mostRemembered) {
+      tables.set(localization, std::move(found));
+    }
+    if (usable) break;
   }
   if (tables.size() == 0) return;
   if (known) {

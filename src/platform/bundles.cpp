@@ -10,8 +10,7 @@ std::optional<PropertyListValue> bundleIdentifier(const PropertyListDictionary& 
 std::optional<std::string> localizedResourceName(std::string_view name, std::string_view type,
                                                  std::string_view localization) {
   using namespace std::string_view_literals;
-  constexpr std::size_t longestLocalization = 128;
-  if (localization.empty() || localization.size() > longestLocalization || localization.front() == '.' ||
+  if (localization.empty() || localization.size() > longestLocalizationName || localization.front() == '.' ||
       localization.find_first_of("/\0"sv) != std::string_view::npos) {
     return std::nullopt;
   }

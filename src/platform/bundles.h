@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <memory>
 #include <optional>
 #include <string>
@@ -37,8 +38,11 @@ class Bundles {
 /// Makes the identifier that every bundle implementation reports from an information dictionary.
 std::optional<PropertyListValue> bundleIdentifier(const PropertyListDictionary& informationDictionary);
 
+/// Longer names, in bytes, name no localization.
+inline constexpr std::size_t longestLocalizationName = 128;
+
 /// The path of a resource below its bundle ("Resources/LOC/NAME.TYPE"); absent for a localization name that
-/// is empty, longer than 128 bytes, begins with a dot or holds a "/" or a NUL.
+/// is empty, longer than `longestLocalizationName`, begins with a dot or holds a "/" or a NUL.
 std::optional<std::string> localizedResourceName(std::string_view name, std::string_view type,
                                                  std::string_view localization);
 
