@@ -8,6 +8,7 @@
 #include <sys/socket.h>
 #include <sys/time.h>
 #include <unistd.h>
+#include <utility>
 
 #include "platform/linux/endpoint_socket.h"
 #include "platform/property_list.h"
@@ -141,6 +142,7 @@ void ConduitTest::stopServer() {
 
 void ConduitTest::handle(const ConduitEvent& event) {
   queue.assertCurrent();
+  EXPECT_FALSE(std::exchange(handling, true)) << "an event inside the handling of another";
   if (const auto* connection = std::get_if<std::shared_ptr<ConduitConnection>>(&event)) {
     const std::lock_guard lock(mutex);
     peers.push_back((*connection)->peer()->processID());
@@ -152,21 +154,23 @@ void ConduitTest::handle(const ConduitEvent& event) {
   } else {
     perform(std::get<std::shared_ptr<ConduitMessage>>(event));
   }
+  handling = false;
   changed.notify_all();
 }
 
 void ConduitTest::perform(const std::shared_ptr<ConduitMessage>& message) {
   const std::string* text = message->contents().asString();
   const std::string what = text ? *text : "";
-  const std::lock_guard lock(mutex);
-  ++requests;
-  if (what == "hold") {
-    held.push_back(message);
-  } else if (what == "big") {
+  {
+    const std::lock_guard lock(mutex);
+    ++requests;
+    if (what == "hold") held.push_back(message);
+  }
+  if (what == "big") {
     message->reply(big);
   } else if (what.starts_with("elsewhere")) {
     otherQueue.async([message] { message->reply(message->contents()); });
-  } else if (what != "drop") {
+  } else if (what != "hold" && what != "drop") {
     message->reply(message->contents());
   }
 }

@@ -103,6 +103,8 @@ class ConduitTest : public testing::Test {
  private:
   void handle(const ConduitEvent& event);
   void perform(const std::shared_ptr<ConduitMessage>& message);
+
+  bool handling = false;  // on queue
 };
 
 }  // namespace kel::platform

@@ -122,6 +122,20 @@ TEST_F(ConduitTest, AMessageThatStaysHalfSentForTenSecondsEndsItsConnection) {
   EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("half sent")));
 }
 
+TEST_F(ConduitTest, RequestsThatArriveTogetherAreAnsweredOneAfterTheOther) {
+  startServer();
+  RawClient client(socketPath());
+  Bytes together;
+  for (std::uint64_t tag = 1; tag <= 20; ++tag) {
+    const Bytes frame = requestFrame(tag, static_cast<int>(tag));
+    together.insert(together.end(), frame.begin(), frame.end());
+  }
+  client.send(together);
+  for (std::uint64_t tag = 1; tag <= 20; ++tag) {
+    EXPECT_EQ(client.receiveReply(tag), PropertyListValue(static_cast<int>(tag)));
+  }
+}
+
 TEST_F(ConduitTest, DescriptorsThatSomebodySendsAreClosedAtOnce) {
   startServer();
   RawClient client(socketPath());
