@@ -1,0 +1,51 @@
+# Short names for what CMake, CTest and the scripts do. Everything that is made lies in build*/.
+SHELL := /bin/bash
+.SHELLFLAGS := -euo pipefail -c
+.DEFAULT_GOAL := build
+.PHONY: build demo test bench fuzz format check-format clean
+
+NEED := scripts/install-dependencies
+SOURCES = find . -path './build*' -prune -o \( -name '*.h' -o -name '*.cpp' \) -print
+
+build:
+	@$(NEED) build
+	@[ -f build/build.ninja ] || cmake -S . -B build -G Ninja -DKEL_TESTS=OFF
+	@cmake --build build --target kel
+
+demo: build
+	@scripts/demo build/kel
+
+test:
+	@$(NEED) build test
+	@cmake -S . -B build -G Ninja -DKEL_TESTS=ON
+	@cmake --build build
+	@ctest --test-dir build --output-on-failure --no-tests=error -j "$$(nproc)"
+
+# BENCH_ARGS go to every program, for instance BENCH_ARGS=--benchmark_filter=Cold; BENCH_BUNDLES sets the
+# size of the corpus.
+BENCH_BUNDLES ?= 10000
+bench:
+	@$(NEED) build bench
+	@cmake -S . -B build-bench -G Ninja -DCMAKE_BUILD_TYPE=Release -DKEL_TESTS=OFF -DKEL_BENCH=ON
+	@cmake --build build-bench
+	@scripts/bench build-bench $(BENCH_BUNDLES) $(BENCH_ARGS)
+
+# Ten seconds for each target, or FUZZ_SECONDS.
+FUZZ_SECONDS ?= 10
+fuzz:
+	@$(NEED) build ci
+	@cmake -S . -B build-fuzz -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DKEL_TESTS=OFF -DKEL_FUZZ=ON \
+	  -DKEL_SANITIZE=address,undefined
+	@cmake --build build-fuzz
+	@scripts/fuzz build-fuzz $(FUZZ_SECONDS)
+
+format:
+	@$(NEED) ci
+	@$(SOURCES) | xargs clang-format -i
+
+check-format:
+	@$(NEED) ci
+	@$(SOURCES) | xargs clang-format --dry-run --Werror
+
+clean:
+	@rm -rf build build-*
