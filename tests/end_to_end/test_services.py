@@ -1,0 +1,171 @@
+"""What clients, the cache file and the published preferences hold, from the example bundles."""
+
+import hashlib
+import hmac
+import plistlib
+
+import pytest
+from conftest import FLUSH, GET, UPDATE, encode, wait_until
+
+# (bundle, title, what else matters): in the order of the bundle identifiers.
+OFFERED = [
+    ("Session Summary.service", "Summarise Session", {"QVRestricted": True}),
+    ("Change Case.service", "Change Case/Upper Case", {"QVMessage": "upperCase", "QVPortName": "ChangeCase"}),
+    ("Change Case.service", "Change Case/Lower Case", {"QVMessage": "lowerCase"}),
+    ("Change Case.service", "Change Case/Title Case", {"QVIcon": None}),
+    ("Colour Tray.app", "Pick Colours from Picture", {"QVSendFileTypes": ["image/png", "image/tiff"]}),
+    ("Draft Speller.app", "Proofread Draft", {"QVSpellChecker": None}),
+    ("Erase Selection.service", "Erase for Good", {"QVRestricted": True}),
+    ("Glossary.service", "Show in Glossary", {"QVForbiddenContext": {"QVApplicationIdentifier": "org.example.exam-room"}}),
+    ("House Spelling.service", None, {"QVSpellChecker": "HouseSpelling", "QVMessage": "HouseSpelling"}),
+    ("Note Slips.service", "Make Note Slip", {"QVKeyEquivalent": {"default": "Y"}}),
+    ("Parcel Post.app", "Parcel Post/Send Files", {"QVHost": "parcels.example", "QVTimeout": "10000"}),
+    ("Parcel Post.app", "Parcel Post/Print Label", {"QVHost": None}),
+    ("Shorten Text.service", "Shorten", {"QVRequiredContext": {"QVWordLimit": 500}, "QVRestricted": None}),
+    ("Shorten Text.service", "Keep First Sentence", {"QVRequiredContext": None}),
+    ("Table Maker.service", None, {"QVFilter": "tabulate", "QVSupportsDataTranslation": False}),
+    ("Word Count.service", "Count Words", {"QVReturnTypes": None}),
+]
+
+
+def test_the_list_from_the_example_bundles(served):
+    services = served.services()
+    found = [
+        (service["QVBundlePath"].rsplit("/", 1)[1], service["QVMenuItem"].get("default"), {key: service.get(key) for key in expected})
+        for service, (_, _, expected) in zip(services, OFFERED)
+    ]
+    assert found == OFFERED and len(services) == len(OFFERED)
+    for index, service in enumerate(each for each in services if each["QVBundlePath"].endswith("Shorten Text.service")):
+        application = hashlib.md5(b"\xff\xfe" + service["QVBundlePath"].encode("utf-16-le")).digest()
+        assert service["QVUUID"] == hmac.digest(application, index.to_bytes(4, "little"), "md5")
+    served.expect_log("Malformed Services entries in Info.plist for Service at URL")
+    for problem in (
+        "The value for key QVMessage was supposed to be of type QVString, but instead it was of type QVNumber",
+        "The value for key QVMenuItem was supposed to be of type QVDictionary, but instead it was of type QVString",
+        "The value for key QVSendTypes was supposed to contain types QVString, but instead it was found to contain type QVNumber",
+        "The value for key QVWordLimit was supposed to be of type QVNumber, but instead it was of type QVString",
+        "The value for key QVServices was supposed to contain types QVDictionary, but instead it was found to contain type QVString",
+    ):
+        served.expect_log(problem)
+    status, printed = served.client("-dump")
+    assert (status, printed.count("QVUUID = ")) == (0, len(OFFERED))
+
+
+def localized(services, title):
+    found = next(each for each in services if each["QVMenuItem"].get("default") == title)
+    return {name: value for name, value in found["QVMenuItem"].items() if name != "default"}
+
+
+def test_a_reply_to_localizations_holds_the_translations(served):
+    first = served.services({"localizations": ["German", "French"]})
+    assert localized(first, "Shorten") == {"German": "Kürzen"}
+    assert localized(first, "Show in Glossary") == {"French": "Chercher dans le glossaire"}
+    assert localized(first, "Change Case/Upper Case") == {"German": "Schreibweise/Großbuchstaben"}
+    second = served.services({"command": "no such command", "localizations": ["French"]})
+    assert localized(second, "Keep First Sentence") == {"German": "Ersten Satz behalten", "French": "Garder la première phrase"}
+    third = served.services({"localizations": ["Japanese"]})
+    assert localized(third, "Proofread Draft") == {"Japanese": "下書きを校正"}
+    keys = next(each["QVKeyEquivalent"] for each in third if each["QVMenuItem"].get("default") == "Shorten")
+    assert keys == {"default": "s", "German": "k", "French": "r"}
+    for known in (["Japanese"], []):
+        assert served.services({"localizations": known}) == third
+
+
+def test_the_list_is_published_with_the_localizations_asked_for(served):
+    path = served.state / "preferences" / "com.orvex.ServicesMenu.Services.plist"
+
+    def published():
+        return plistlib.loads(path.read_bytes())["QVServices"] if path.exists() else None
+
+    services = served.services({"localizations": ["German"]})
+    expected = {"KTVersion": 2, "KTPrincipalLocalizations": ["German"], "KTVendedServices": services}
+    wait_until(lambda: published() == expected, "the publication")
+    status, printed = served.client("-generate_whitelist")
+    path_written = served.root / "tmp" / "com.orvex.QVServicesRestrictions.plist"
+    assert (status, printed) == (0, f"Wrote to {path_written}\n")
+    assert plistlib.loads(path_written.read_bytes()) == {
+        "QVUnrestricted": [{"QVBundleID": "com.orvex.session-summary", "QVMenuItem": "Summarise Session"}],
+        "QVRestricted": [],
+    }
+    served.ask(FLUSH)
+    wait_until(lambda: published() == {"KTVersion": 2, "KTPrincipalLocalizations": [], "KTVendedServices": []}, "the flush")
+
+
+def test_debug_output_comes_when_asked_for_with_a_boolean(served):
+    home = served.home
+    lines = served.ask(UPDATE | {"debug": True})["debug_output"].split("\n")
+    for expected in (
+        "Updating Services cache",
+        f"Loading Services from path {home}/Library/Services/Scrambled.service",
+        f"Unable to create a bundle for path {home}/Library/Services/Read Me.txt, skipping it",
+        "Fetching localization(s): ",
+        f"Collision resolution: preferring {home}/Library/Services/Note Slips.service"
+        f" to {home}/Applications/Note Slips.app due to directory precedence",
+    ):
+        assert expected in lines
+    for other in ("yes", 1, ["debug"]):
+        assert "debug_output" not in served.ask(GET | {"debug": other})
+
+
+def test_a_changed_bundle_shows_after_an_update_and_a_removed_one_is_gone(served):
+    declared = served.home / "Library/Services/Change Case.service/Info.plist"
+    declared.write_text(declared.read_text().replace("Title Case", "Capitals"))
+    (served.home / "Library/Services/Word Count.service").rename(served.root / "elsewhere")
+    served.put_bundle("new.service", "Brand New")
+    served.ask(UPDATE)
+    changed = set(served.titles()) ^ {title for _, title, _ in OFFERED}
+    assert changed == {"Change Case/Capitals", "Change Case/Title Case", "Count Words", "Brand New"}
+
+
+def test_a_flush_forgets_the_list_and_the_cache_file(served):
+    wait_until(served.cache.exists, "the cache file")
+    assert served.ask(FLUSH) == {}
+    assert served.services() == []  # what the first request of a fresh store gets, while the rebuild goes on
+    served.ask(UPDATE)
+    assert served.titles() == [title for _, title, _ in OFFERED]
+
+
+def test_a_restarted_server_answers_from_the_cache_file(served):
+    before = served.ask({"localizations": ["German"]})["data"]
+    wait_until(lambda: b"German" in served.cache.read_bytes(), "the cache file")
+    assert served.stop() == 0
+    served.start()
+    assert served.ask(GET)["data"] == before
+    cached = plistlib.loads(served.cache.read_bytes())
+    assert set(cached) >= {"QVServicesLastEventID", "QVServicesSessionID", "QVServicesBuildVersion", "QVServicesARPaths"}
+    assert f"{served.home}/Library/Services/" in cached["QVServicesExplicitDirectoryCache"]
+    status, printed = served.client("-dump_cache")
+    assert status == 0 and "loc_to_menu_strings = {" in printed
+
+
+@pytest.mark.parametrize(
+    "spoil, first",
+    [
+        (lambda good: b"", 0),
+        (lambda good: b"bplist00 and no more", 0),
+        (lambda good: good[: len(good) // 2], 0),
+        (lambda good: encode([]), 0),
+        (lambda good: encode(plistlib.loads(good) | {"QVServicesBuildVersion": "another"}), 0),
+        (lambda good: encode(plistlib.loads(good) | {"ServicesCache": {"/x": 7, "/y": {"service_dicts": [7]}}}), 0),
+        (lambda good: encode(plistlib.loads(good) | {"QVServicesLastEventID": "7", "QVServicesARPaths": 7}), len(OFFERED)),
+    ],
+    ids=["empty", "cut trailer", "half", "no dictionary", "another build", "odd entries", "odd values"],
+)
+def test_a_spoiled_cache_file_costs_a_rebuild_and_no_more(served, spoil, first):
+    wait_until(served.cache.exists, "the cache file")
+    assert served.stop() == 0
+    served.cache.write_bytes(spoil(served.cache.read_bytes()))
+    served.start()
+    assert len(served.services()) == first
+    served.ask(UPDATE)
+    assert served.titles() == [title for _, title, _ in OFFERED]
+
+
+def test_a_mock_registry_change_bumps_the_seed(served):
+    def seeds():
+        return {path.name: path.read_bytes() for path in (served.run / "kel" / "beacond").glob("*qvservices.seed*")}
+
+    served.services()  # clears what became stale before, so that the next change counts
+    before = seeds()
+    assert before and served.client("-mockar") == (0, "Mocking complete\n")
+    wait_until(lambda: seeds() != before, "another seed")
