@@ -146,6 +146,10 @@ class Home:
         status, self.server = self.server.wait(30), None
         return status
 
+    def cached(self):
+        """The bytes of the cache file; none when there is no file."""
+        return self.cache.read_bytes() if self.cache.exists() else b""
+
     def log(self):
         return self.log_path.read_text(errors="replace")
 

@@ -69,8 +69,10 @@ GOOD = [
 ]
 
 
-@pytest.mark.parametrize("arguments, status, printed, requests", [(bad, 1, USAGE, []) for bad in BAD] +
-                         [(arguments, 0, printed, requests) for arguments, printed, requests in GOOD])  # fmt: skip
+ROWS = [(arguments, 1, USAGE, []) for arguments in BAD] + [(arguments, 0, *expected) for arguments, *expected in GOOD]
+
+
+@pytest.mark.parametrize("arguments, status, printed, requests", ROWS, ids=[row[0] or "(none)" for row in ROWS])
 def test_the_command_line(home, answering, arguments, status, printed, requests):
     assert home.client(*arguments.split()) == (status, printed.format(cache=home.cache))
     assert answering.requests == requests

@@ -162,8 +162,8 @@ def test_kill_at_any_time_leaves_a_readable_cache_or_none(crowded):
         except TimeoutError:
             pass
         crowded.stop(signal.SIGKILL)
-        if crowded.cache.exists():
-            assert len(plistlib.loads(crowded.cache.read_bytes())["ServicesCache"]) == MANY
+        if cached := crowded.cached():
+            assert len(plistlib.loads(cached)["ServicesCache"]) == MANY
         crowded.start()
         assert len(crowded.services()) in (0, MANY)
     crowded.ask(UPDATE)

@@ -118,7 +118,7 @@ def test_a_changed_bundle_shows_after_an_update_and_a_removed_one_is_gone(served
 
 
 def test_a_flush_forgets_the_list_and_the_cache_file(served):
-    wait_until(served.cache.exists, "the cache file")
+    wait_until(served.cached, "the cache file")
     assert served.ask(FLUSH) == {}
     assert served.services() == []  # what the first request of a fresh store gets, while the rebuild goes on
     served.ask(UPDATE)
@@ -127,11 +127,11 @@ def test_a_flush_forgets_the_list_and_the_cache_file(served):
 
 def test_a_restarted_server_answers_from_the_cache_file(served):
     before = served.ask({"localizations": ["German"]})["data"]
-    wait_until(lambda: b"German" in served.cache.read_bytes(), "the cache file")
+    wait_until(lambda: b"Notizzettel" in served.cached(), "the cache file")
     assert served.stop() == 0
     served.start()
     assert served.ask(GET)["data"] == before
-    cached = plistlib.loads(served.cache.read_bytes())
+    cached = plistlib.loads(served.cached())
     assert set(cached) >= {"QVServicesLastEventID", "QVServicesSessionID", "QVServicesBuildVersion", "QVServicesARPaths"}
     assert f"{served.home}/Library/Services/" in cached["QVServicesExplicitDirectoryCache"]
     status, printed = served.client("-dump_cache")
@@ -152,9 +152,9 @@ def test_a_restarted_server_answers_from_the_cache_file(served):
     ids=["empty", "cut trailer", "half", "no dictionary", "another build", "odd entries", "odd values"],
 )
 def test_a_spoiled_cache_file_costs_a_rebuild_and_no_more(served, spoil, first):
-    wait_until(served.cache.exists, "the cache file")
+    wait_until(served.cached, "the cache file")
     assert served.stop() == 0
-    served.cache.write_bytes(spoil(served.cache.read_bytes()))
+    served.cache.write_bytes(spoil(served.cached()))
     served.start()
     assert len(served.services()) == first
     served.ask(UPDATE)
