@@ -1,0 +1,135 @@
+// Whole updates over the corpus that KEL_BENCH_CORPUS names, in a scratch home beside it: cold, after a
+// restart from the cache file, and when nothing changed.
+
+#include <benchmark/benchmark.h>
+#include <cstdlib>
+#include <filesystem>
+#include <memory>
+#include <string>
+
+#include "datastore/data_store.h"
+#include "platform/linux/linux_platform.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+/// A home whose services and applications are the corpus, gone again at the end.
+class ScratchHome {
+ public:
+  explicit ScratchHome(const std::string& corpus) : home_(fs::path(corpus).concat(".home")) {
+    fs::remove_all(home_);
+    fs::create_directories(home_ / "Library");
+    fs::create_directories(home_ / "run");
+    fs::permissions(home_ / "run", fs::perms::owner_all);
+    fs::create_directory_symlink(fs::path(corpus) / "Library/Services", home_ / "Library/Services");
+    fs::create_directory_symlink(fs::path(corpus) / "Applications", home_ / "Applications");
+    for (const auto& [name, folder] : {std::pair{"HOME", ""},
+                                       {"XDG_CACHE_HOME", "cache"},
+                                       {"XDG_RUNTIME_DIR", "run"},
+                                       {"XDG_STATE_HOME", "state"},
+                                       {"XDG_CONFIG_HOME", "config"}}) {
+      setenv(name, (home_ / folder).c_str(), 1);
+    }
+  }
+  ~ScratchHome() { fs::remove_all(home_); }
+
+ private:
+  const fs::path home_;
+};
+
+/// The platform in a scratch home; null, with the state marked, when no corpus is named.
+kel::platform::Platform* platform(benchmark::State& state) {
+  const char* corpus = std::getenv("KEL_BENCH_CORPUS");
+  if (!corpus) {
+    state.SkipWithError("KEL_BENCH_CORPUS names no corpus");
+    return nullptr;
+  }
+  static const ScratchHome home{corpus};
+  static kel::platform::LinuxPlatform linuxPlatform;
+  return &linuxPlatform.platform();
+}
+
+void report(benchmark::State& state, kel::KELDataStore& store) {
+  const auto services = static_cast<double>(store.currentPublicDictionaries().asArray()->size());
+  state.counters["services"] = services;
+  state.counters["services/s"] = benchmark::Counter(services, benchmark::Counter::kIsIterationInvariantRate);
+}
+
+void BM_ColdUpdate(benchmark::State& state) {
+  kel::platform::Platform* services = platform(state);
+  if (!services) return;
+  std::unique_ptr<kel::KELDataStore> store;
+  for (auto _ : state) {
+    state.PauseTiming();
+    if (store) store->flushCaches();
+    store = kel::KELDataStore::initWithSystemServices(*services);
+    state.ResumeTiming();
+    store->updateServicesCache(kel::KELStaleEverything);
+    benchmark::DoNotOptimize(store->currentPublicDictionaries());
+  }
+  report(state, *store);
+}
+BENCHMARK(BM_ColdUpdate)->Unit(benchmark::kMillisecond)->UseRealTime();
+
+void BM_RestartFromTheCache(benchmark::State& state) {
+  kel::platform::Platform* services = platform(state);
+  if (!services) return;
+  {
+    const auto writing = kel::KELDataStore::initWithSystemServices(*services);
+    writing->updateServicesCache(kel::KELStaleEverything);
+    writing->writeCaches();
+  }
+  std::unique_ptr<kel::KELDataStore> store;
+  for (auto _ : state) {
+    store = kel::KELDataStore::initWithSystemServices(*services);
+    benchmark::DoNotOptimize(store->currentPublicDictionaries());
+  }
+  report(state, *store);
+}
+BENCHMARK(BM_RestartFromTheCache)->Unit(benchmark::kMillisecond)->UseRealTime();
+
+/// With `flags` as the stale sources: 0 asks nothing anew, 2 asks the journal.
+void BM_UpdateWithNothingChanged(benchmark::State& state) {
+  kel::platform::Platform* services = platform(state);
+  if (!services) return;
+  const auto store = kel::KELDataStore::initWithSystemServices(*services);
+  store->updateServicesCache(kel::KELStaleEverything);
+  for (auto _ : state) {
+    store->updateServicesCache(static_cast<kel::KELStaleCacheFlags>(state.range(0)));
+    benchmark::DoNotOptimize(store->currentPublicDictionaries());
+  }
+  report(state, *store);
+}
+BENCHMARK(BM_UpdateWithNothingChanged)
+    ->ArgName("flags")
+    ->Arg(0)
+    ->Arg(2)
+    ->Unit(benchmark::kMillisecond)
+    ->UseRealTime();
+
+void BM_FetchALocalization(benchmark::State& state) {
+  kel::platform::Platform* services = platform(state);
+  if (!services) return;
+  std::unique_ptr<kel::KELDataStore> store;
+  for (auto _ : state) {
+    state.PauseTiming();
+    if (store) store->flushCaches();
+    store = kel::KELDataStore::initWithSystemServices(*services);
+    store->updateServicesCache(kel::KELStaleEverything);
+    state.ResumeTiming();
+    store->fetchLocalizations({{"German"}});
+  }
+}
+BENCHMARK(BM_FetchALocalization)->Unit(benchmark::kMillisecond)->UseRealTime();
+
+void BM_WriteTheCacheFile(benchmark::State& state) {
+  kel::platform::Platform* services = platform(state);
+  if (!services) return;
+  const auto store = kel::KELDataStore::initWithSystemServices(*services);
+  store->updateServicesCache(kel::KELStaleEverything);
+  for (auto _ : state) store->writeCaches();
+}
+BENCHMARK(BM_WriteTheCacheFile)->Unit(benchmark::kMillisecond)->UseRealTime();
+
+}  // namespace
