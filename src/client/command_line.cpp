@@ -72,13 +72,15 @@ std::variant<Invocation, int> parse(const std::vector<std::string>& arguments) {
 }
 
 void dumpCache(platform::Platform& platform, std::ostream& output) {
-  const std::string path = cache_file_path(platform.directories).value_or("(null)");
+  const std::optional<std::string> path = cache_file_path(platform.directories);
   const platform::DictionaryReading cache =
-      platform::readDictionaryFile(platform.files, path, platform::largestOwnFile);
+      path
+          ? platform::readDictionaryFile(platform.files, *path, platform::largestOwnFile, platform::ownLimits)
+          : platform::DictionaryReading();
   if (cache.dictionary) {
     output << platform::describe(*cache.dictionary) << "\n";
   } else {
-    output << "Couldn't read " << path << "\n";
+    output << "Couldn't read " << path.value_or("(null)") << "\n";
   }
 }
 
@@ -143,7 +145,8 @@ void print_reply(const platform::ConduitReply& reply, PrintedData printedData, s
   if (debugOutput && debugOutput->asString()) output << *debugOutput->asString() << "\n";
   const PropertyListValue* data = dictionary->find(protocol::data);
   if (printedData == PrintedData::No || !data || !data->asData()) return;
-  const platform::PropertyListReading list = platform::readPropertyList(**data->asData());
+  const platform::PropertyListReading list =
+      platform::readPropertyList(**data->asData(), platform::ownLimits);
   if (list.value) {
     output << platform::describe(*list.value) << "\n";
   } else {

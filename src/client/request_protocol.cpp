@@ -4,7 +4,7 @@
 #include <sstream>
 #include <utility>
 
-#include "platform/bundles.h"
+#include "common/common.h"
 #include "platform/property_list.h"
 
 namespace kel {
@@ -42,12 +42,13 @@ bool wants_debug(const PropertyListDictionary& request) {
 std::vector<std::string> requested_localizations(const PropertyListDictionary& request) {
   const PropertyListValue* localizations = request.find(protocol::localizations);
   const PropertyListArray* array = localizations ? localizations->asArray() : nullptr;
-  std::vector<std::string> names;
-  for (std::size_t i = 0; array && i < array->size() && names.size() < mostRequestedLocalizations; ++i) {
-    const std::string* name = (*array)[i].asString();
-    if (name && name->size() <= platform::longestLocalizationName) names.push_back(*name);
-  }
-  return names;
+  if (!array) return {};
+  const PropertyListArray first(
+      array->begin(),
+      array->begin() + static_cast<std::ptrdiff_t>(std::min(array->size(), mostRequestedLocalizations)));
+  return map_array(first, [](const PropertyListValue& name) {
+    return name.asString() ? std::optional(*name.asString()) : std::nullopt;
+  });
 }
 
 void send_kel_command(platform::Platform& platform, std::string_view command, bool debug,
@@ -102,7 +103,7 @@ std::string unknown_message_type(std::string_view routine, std::string_view subj
 
 std::string unknown_message_type(std::string_view routine, std::string_view subject,
                                  const PropertyListValue& value) {
-  return unknownType(routine, subject, value.typeAddress(), platform::describe(value));
+  return unknownType(routine, subject, value.typeAddress(), platform::describeBriefly(value));
 }
 
 }  // namespace kel

@@ -46,8 +46,7 @@ bool wants_debug(const platform::PropertyListDictionary& request);
 /// How many names of one request are looked at: each may cost a look at every bundle.
 inline constexpr std::size_t mostRequestedLocalizations = 64;
 
-/// The "localizations" of a request classified as `KELCommandLocalizations`, in their order, without names
-/// too long to name any; no more than `mostRequestedLocalizations`.
+/// The first of the "localizations" of a request classified as `KELCommandLocalizations`, in their order.
 std::vector<std::string> requested_localizations(const platform::PropertyListDictionary& request);
 
 /// Takes the reply to a request, or the error object that came in its place.

@@ -101,7 +101,7 @@ std::optional<PropertyListDictionary> KELDataStore::cacheDictionary() const {
   const std::optional<std::string> path = cacheFilePath();
   if (!path) return std::nullopt;
   platform::DictionaryReading cache =
-      platform::readDictionaryFile(platform_.files, *path, platform::largestOwnFile);
+      platform::readDictionaryFile(platform_.files, *path, platform::largestOwnFile, platform::ownLimits);
   if (!cache.dictionary) {
     send_debug_line([&] {
       return "Cache at " + *path + " came back nil (file does" +

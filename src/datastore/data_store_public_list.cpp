@@ -12,13 +12,16 @@ using platform::PropertyListValue;
 
 namespace {
 
+/// Well below what can be written: no single bundle, nor a few of them, may keep the list from being made.
+constexpr std::uint64_t largestList = std::uint64_t{1} << 29;
+
 /// The identifier as text; one of another kind, which only a cache file can hold, stands for itself by its
 /// description.
 std::optional<std::string> identifierText(const KELAppEntry& entry) {
   const std::optional<PropertyListValue> identifier = entry.bundleID();
   if (!identifier) return std::nullopt;
   const std::string* text = identifier->asString();
-  return text ? *text : platform::describe(*identifier);
+  return text ? *text : platform::describeBriefly(*identifier);
 }
 
 }  // namespace
@@ -71,7 +74,18 @@ const PropertyListValue& KELDataStore::currentPublicDictionaries() {
   if (currentPublicDictionaries_) return *currentPublicDictionaries_;
   if (!cacheIsLoaded_) loadCache();
   std::vector<PropertyListDictionaryBuilder> services;
-  for (const auto& entry : uniquedAppEntries()) entry->addPublicDictionariesForServices(services);
+  std::uint64_t size = 0;
+  for (const auto& entry : uniquedAppEntries()) {
+    const std::size_t before = services.size();
+    entry->addPublicDictionariesForServices(services);
+    for (std::size_t i = before; i < services.size(); ++i) size += services[i].expandedSize();
+    if (size > largestList) {
+      platform_.log.write("The services list is full; leaving out the services of " + entry->bundlePath() +
+                          " and of what sorts after it");
+      services.resize(before);
+      break;
+    }
+  }
   removeInvalidSpellCheckers(services);
   apply_restriction_lists(services, restrictionLists_.get());
 

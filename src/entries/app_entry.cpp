@@ -10,8 +10,8 @@ namespace kel {
 
 namespace {
 
-// How many localizations an entry remembers before it forgets that it has looked for further ones in vain: their names
-// come from clients, and there may be any number of them.
+// How many localizations an entry remembers before it forgets that it has looked for further ones in vain:
+// their names come from clients, and there may be any number of them.
 constexpr std::size_t mostRemembered = 256;
 
 using platform::PropertyListDictionary;

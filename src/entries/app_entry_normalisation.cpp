@@ -18,6 +18,9 @@ using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListString;
 using platform::PropertyListValue;
 
+/// How large the services of one bundle may be in all: short declarations can share long texts.
+constexpr std::uint64_t largestServices = 16 * 1024 * 1024;
+
 /// A value of a kind that a public dictionary cannot be made from.
 struct UnusableValue : std::runtime_error {
   using std::runtime_error::runtime_error;
@@ -225,8 +228,14 @@ void KELAppEntry::addPublicDictionariesForServices(
     if (!declaredServices) throw UnusableValue("the declared services are no array");
     const MenuStringsTables tables(localizationToMenuStrings());
     std::uint32_t index = 0;
-    for (const PropertyListValue& service : *declaredServices)
-      services.push_back(transformServiceDictionaryForPlist(service, index++, tables));
+    std::uint64_t size = 0;
+    for (const PropertyListValue& declaredService : *declaredServices) {
+      PropertyListDictionaryBuilder service =
+          transformServiceDictionaryForPlist(declaredService, index++, tables);
+      size += service.expandedSize();
+      if (size > largestServices) throw UnusableValue("its services are too large");
+      services.push_back(std::move(service));
+    }
   } catch (const UnusableValue& failure) {
     platform_.log.write("Exception processing Services at path " + bundlePath() + ": " + failure.what());
   }

@@ -18,6 +18,9 @@ struct PropertyListLimits {
   std::optional<std::uint64_t> expandedSize;
 };
 
+/// What the writer writes, and so the limits for what this program wrote itself.
+inline constexpr PropertyListLimits ownLimits{512, std::uint64_t{1} << 30};
+
 /// A value, or one line that says what is wrong and where.
 struct PropertyListReading {
   std::optional<PropertyListValue> value;
@@ -53,5 +56,9 @@ PropertyListWriting writeBinaryPropertyList(const PropertyListValue& value);
 /// The human-readable rendering of a value, in the text encoding: what is printed reads back with the text
 /// reader, numbers, booleans and dates as strings. No newline at the end.
 std::string describe(const PropertyListValue& value);
+
+/// The same for a log: cut, with a mark, at about `longest` bytes. Indentation alone can make a description
+/// far larger than its value.
+std::string describeBriefly(const PropertyListValue& value, std::size_t longest = 4096);
 
 }  // namespace kel::platform

@@ -15,7 +15,6 @@ namespace {
 constexpr std::size_t largeData = 4096;
 
 /// Above this a value is not written: its objects would not fit into memory.
-constexpr std::uint64_t largestExpandedSize = std::uint64_t{1} << 30;
 
 /// Object numbers by hash, with open addressing.
 class NumberTable {
@@ -332,8 +331,8 @@ class BinaryWriter {
 std::string refusal(const PropertyListValue& value) {
   constexpr std::uint32_t deepest = PropertyListLimits{}.depth;
   if (value.depth() > deepest) return "the value nests deeper than " + std::to_string(deepest) + " levels";
-  if (value.expandedSize() > largestExpandedSize) {
-    return "the value expands to more than " + std::to_string(largestExpandedSize) + " bytes";
+  if (value.expandedSize() > *ownLimits.expandedSize) {
+    return "the value expands to more than " + std::to_string(*ownLimits.expandedSize) + " bytes";
   }
   return {};
 }

@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cmath>
 #include <cstdio>
+#include <limits>
 
 #include "platform/property_list.h"
 #include "platform/property_list_parsing.h"
@@ -46,9 +47,10 @@ std::string dateText(PropertyListDate date) {
 
 class Describer {
  public:
-  std::string describe(const PropertyListValue& top) {
+  /// Stops soon after `longest` bytes.
+  std::string describe(const PropertyListValue& top, std::size_t longest) {
     begin(top);
-    while (!open_.empty()) {
+    while (!open_.empty() && text_.size() <= longest) {
       Container& container = open_.back();
       if (container.next == container.size()) {
         const char closing = container.dictionary ? '}' : ')';
@@ -165,6 +167,17 @@ class Describer {
 
 }  // namespace
 
-std::string describe(const PropertyListValue& value) { return Describer().describe(value); }
+std::string describe(const PropertyListValue& value) {
+  return Describer().describe(value, std::numeric_limits<std::size_t>::max());
+}
+
+std::string describeBriefly(const PropertyListValue& value, std::size_t longest) {
+  std::string text = Describer().describe(value, longest);
+  if (text.size() <= longest) return text;
+  // Not within a character: its further bytes begin with the bits 10.
+  while (longest > 0 && (static_cast<unsigned char>(text[longest]) & 0xC0) == 0x80) --longest;
+  text.resize(longest);
+  return text + " [cut]";
+}
 
 }  // namespace kel::platform

@@ -17,6 +17,10 @@ std::uint64_t addSaturating(std::uint64_t a, std::uint64_t b) {
   return sum < a ? std::numeric_limits<std::uint64_t>::max() : sum;
 }
 
+std::uint64_t entrySize(const PropertyListString& key, const PropertyListValue& value) {
+  return addSaturating(key.text().size() + valueCost, value.expandedSize());
+}
+
 }  // namespace
 
 struct PropertyListValue::ArrayNode {
@@ -35,8 +39,7 @@ struct PropertyListValue::ArrayNode {
 struct PropertyListValue::DictionaryNode {
   explicit DictionaryNode(PropertyListDictionary values) : dictionary(std::move(values)) {
     for (const auto& [key, value] : dictionary) {
-      expandedSize =
-          addSaturating(expandedSize, addSaturating(key.text().size() + valueCost, value.expandedSize()));
+      expandedSize = addSaturating(expandedSize, entrySize(key, value));
       depth = std::max(depth, value.depth() + 1);
     }
   }
@@ -163,6 +166,12 @@ const PropertyListValue* PropertyListDictionary::find(std::string_view key) cons
       std::lower_bound(entries_.begin(), entries_.end(), key,
                        [](const Entry& entry, std::string_view k) { return entry.first.text() < k; });
   return found != entries_.end() && found->first.text() == key ? &found->second : nullptr;
+}
+
+std::uint64_t PropertyListDictionaryBuilder::expandedSize() const {
+  std::uint64_t size = valueCost;
+  for (const auto& [key, value] : entries_) size = addSaturating(size, entrySize(key, value));
+  return size;
 }
 
 PropertyListDictionary PropertyListDictionaryBuilder::build() const {

@@ -165,6 +165,9 @@ class PropertyListDictionaryBuilder {
 
   std::size_t size() const { return entries_.size(); }
 
+  /// The `expandedSize` of the dictionary as it stands; takes a walk over its keys.
+  std::uint64_t expandedSize() const;
+
   /// The finished dictionary; the builder stays as it is.
   PropertyListDictionary build() const;
 

@@ -1,8 +1,9 @@
 #include "restrictions/restriction_lists.h"
 
+#include <set>
 #include <string>
 #include <string_view>
-#include <unordered_set>
+#include <unordered_map>
 #include <utility>
 
 #include "common/service_keys.h"
@@ -17,7 +18,24 @@ using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListString;
 using platform::PropertyListValue;
 
-using EntrySet = std::unordered_set<KELRestrictionListEntry, KELRestrictionListEntry::Hash>;
+/// A set of entries. Hashed by title like the entries themselves; the identifiers under one title are
+/// ordered, so that a list with many rows of one title costs no more than another.
+class EntrySet {
+ public:
+  explicit EntrySet(const std::vector<KELRestrictionListEntry>& entries) {
+    for (const KELRestrictionListEntry& entry : entries) {
+      identifiers_[entry.title().text()].insert(entry.bundleID().text());
+    }
+  }
+
+  bool contains(const KELRestrictionListEntry& entry) const {
+    const auto found = identifiers_.find(entry.title().text());
+    return found != identifiers_.end() && found->second.contains(entry.bundleID().text());
+  }
+
+ private:
+  std::unordered_map<std::string_view, std::set<std::string_view>> identifiers_;
+};
 
 constexpr std::string_view unrestrictedKey = "QVUnrestricted";
 constexpr std::string_view restrictedKey = "QVRestricted";
@@ -64,12 +82,9 @@ std::optional<PropertyListDictionary> restriction_lists_to_plist(const KELRestri
 
 void apply_restriction_lists(std::vector<PropertyListDictionaryBuilder>& services,
                              const KELRestrictionLists* lists) {
-  EntrySet unrestricted;
-  EntrySet restricted;
-  if (lists) {
-    unrestricted.insert(lists->unrestricted.begin(), lists->unrestricted.end());
-    restricted.insert(lists->restricted.begin(), lists->restricted.end());
-  }
+  const KELRestrictionLists none;
+  const EntrySet unrestricted((lists ? *lists : none).unrestricted);
+  const EntrySet restricted((lists ? *lists : none).restricted);
   for (PropertyListDictionaryBuilder& service : services) {
     if (service.find(service_keys::QVRestricted)) continue;
     const std::optional<KELRestrictionListEntry> entry = restriction_entry_for_service(service);

@@ -21,13 +21,13 @@ void handleRequest(platform::Platform& platform, KELServer& server,
   const KELCommand command = classify_request(request);
   if (command == KELCommand::KELCommandInvalid) {
     platform.log.write(std::string(routine) +
-                       ": unknown Conduit message: " + platform::describe(message->contents()) + "\n");
+                       ": unknown Conduit message: " + platform::describeBriefly(message->contents()) + "\n");
     return;
   }
   if (sandboxed && refused_to_sandboxed(command)) {
     platform.log.write(std::string(routine) + ": refusing request from sandboxed app " +
                        std::to_string(peer ? peer->processID() : 0) + ": " +
-                       platform::describe(message->contents()) + "\n");
+                       platform::describeBriefly(message->contents()) + "\n");
     return;
   }
   server.conduitQueue().assertCurrent();

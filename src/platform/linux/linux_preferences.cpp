@@ -8,7 +8,7 @@ std::optional<PropertyListValue> LinuxPreferences::value(std::string_view domain
   for (const auto& directory : {stateDirectory_, configurationDirectory_}) {
     const auto path = directory ? preferencesFile(*directory, domain) : std::nullopt;
     if (!path) continue;
-    const DictionaryReading reading = readDictionaryFile(files_, *path, largestOwnFile);
+    const DictionaryReading reading = readDictionaryFile(files_, *path, largestOwnFile, ownLimits);
     const PropertyListValue* found = reading.dictionary ? reading.dictionary->find(key) : nullptr;
     if (found) return *found;
   }

@@ -9,7 +9,7 @@ void LinuxServicesPublication::publish(const PropertyListValue& publication) {
   if (!path) return log_.write("Cannot publish services: there is no state directory");
   PropertyListDictionaryBuilder domain;
   if (files_.exists(*path)) {
-    const DictionaryReading old = readDictionaryFile(files_, *path, largestOwnFile);
+    const DictionaryReading old = readDictionaryFile(files_, *path, largestOwnFile, ownLimits);
     if (old.dictionary) {
       domain = PropertyListDictionaryBuilder(*old.dictionary);
     } else {
