@@ -40,6 +40,10 @@ class ConduitMessage {
   /// What was sent; of any kind, since the peer is not trusted.
   virtual const PropertyListValue& contents() const = 0;
 
+  /// Forgets the contents, which are an empty dictionary from now on: a message that waits for its reply
+  /// should not hold what its sender chose to send. On the connection's queue, like `contents`.
+  virtual void discardContents() = 0;
+
   /// True when the sender waits for a reply and none was sent yet.
   virtual bool canReply() const = 0;
 

@@ -14,6 +14,10 @@ namespace {
 
 constexpr std::size_t mostKnownLocalizations = 256;
 
+bool namesNothing(const std::string& localization) {
+  return localization.size() > platform::longestLocalizationName;
+}
+
 const PropertyListDictionary& dictionaryOf(const ConduitMessage* message) {
   static const PropertyListDictionary empty;
   const PropertyListDictionary* dictionary = message ? message->contents().asDictionary() : nullptr;
@@ -30,10 +34,12 @@ void KELServer::performCommand(KELCommand command, std::shared_ptr<ConduitMessag
 
   // Run once, on either queue. The list is read when the reply is made, so that a reply after queued work
   // carries what the work left.
-  const ReplyAction reply = [this, message = withMessage, debugText = debugText] {
+  const bool withData = command != KELCommand::KELCommandFlush;
+  const ReplyAction reply = [this, message = withMessage, debugText = debugText, withData] {
     if (!message || !message->canReply()) return;
     PropertyListDictionaryBuilder contents;
-    if (const platform::SharedBytes data = currentData()) contents.set(protocol::data, data);
+    if (const platform::SharedBytes data = withData ? currentData() : nullptr)
+      contents.set(protocol::data, data);
     if (debugText) contents.set(protocol::debugOutput, debugText->text());
     message->reply(contents.build());
   };
@@ -53,7 +59,7 @@ void KELServer::performCommand(KELCommand command, std::shared_ptr<ConduitMessag
         break;
       default:
         platform_.log.write("KELServer::performCommand: unknown or invalid Conduit message: " +
-                            (message ? platform::describe(message->contents()) : "(null)") + "\n");
+                            (message ? platform::describeBriefly(message->contents()) : "(null)") + "\n");
         reply();
     }
   };
@@ -62,10 +68,15 @@ void KELServer::performCommand(KELCommand command, std::shared_ptr<ConduitMessag
   } else {
     perform();
   }
+  if (withMessage) withMessage->discardContents();
 }
 
 void KELServer::performFlush(const ReplyAction& reply) {
-  sync(false, [](KELDataStore& dataStore) { dataStore.flushCaches(); });
+  sync(false, [this](KELDataStore& dataStore) {
+    dataStore.flushCaches();
+    // A rebuild that was under way may have made its list current after it was cleared below.
+    setCurrentPublicDictionariesAllowingNotification(std::nullopt);
+  });
   knownLoadedLocalizations_.set(std::make_shared<const Localizations>());
   setCurrentPublicDictionariesAllowingNotification(std::nullopt);
   reply();
@@ -78,6 +89,7 @@ void KELServer::performGet(KELCommand command, const ConduitMessage* message, co
   if (command == KELCommand::KELCommandLocalizations) {
     localizations = requested_localizations(dictionaryOf(message));
     newLocalization = noteNewLocalization(localizations);
+    std::erase_if(localizations, namesNothing);
   }
   if (!currentData()) flags = loadFirstList(flags);
   if (newLocalization || flags != 0) {
@@ -94,17 +106,17 @@ void KELServer::performGet(KELCommand command, const ConduitMessage* message, co
   if (!newLocalization) reply();
 }
 
-/// Adds the first of `localizations` to the known ones; true when it was not among them. A client that goes
-/// on asking for new ones is answered without them from some point on.
+/// Adds the first of `localizations` to the known ones; true when it was not among them. There are so many
+/// known ones at most: a client that goes on asking for new ones takes the place of others, which then count
+/// as new again.
 bool KELServer::noteNewLocalization(const std::vector<std::string>& localizations) {
   const auto known = knownLoadedLocalizations_.copy();
-  if (localizations.empty() || known->contains(localizations.front())) return false;
-  if (known->size() >= mostKnownLocalizations) {
-    platform_.log.write("KELServer::performCommand: too many localizations; not loading " +
-                        localizations.front());
+  if (localizations.empty() || namesNothing(localizations.front()) ||
+      known->contains(localizations.front())) {
     return false;
   }
   auto extended = std::make_shared<Localizations>(*known);
+  if (extended->size() >= mostKnownLocalizations) extended->erase(extended->begin());
   extended->insert(localizations.front());
   knownLoadedLocalizations_.set(std::move(extended));
   return true;

@@ -1,6 +1,7 @@
 #include "server/server.h"
 
 #include <algorithm>
+#include <mutex>
 #include <utility>
 
 #include "common/common.h"
@@ -72,14 +73,15 @@ void KELServer::setCurrentPublicDictionariesAllowingNotification(
     }
     newData = std::make_shared<const platform::Bytes>(std::move(*written.bytes));
   }
-  // Published under the same lock, so that publications come in the order in which the list changed.
-  const bool changed = currentData_.with([&](platform::SharedBytes& data) {
-    if (newData == data || (newData && data && *newData == *data)) return false;
-    data = newData;
+  {
+    // Both queues change the list: publications come in the order of the changes.
+    const std::lock_guard lock(changingList_);
+    const platform::SharedBytes oldData = currentData();
+    if (newData == oldData || (newData && oldData && *newData == *oldData)) return;
+    currentData_.set(newData);
     schmutzItUpForKT(publicDictionaries.value_or(PropertyListArray()));
-    return true;
-  });
-  if (changed) incrementServicesSeed();
+  }
+  incrementServicesSeed();
 }
 
 void KELServer::updateServicesCache(KELStaleCacheFlags flags, std::uint32_t ifGenerationIsCurrent,

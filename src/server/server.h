@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <set>
 #include <string>
@@ -97,6 +98,7 @@ class KELServer {
   const std::unique_ptr<KELDataStore> protectedDatastore_;  // its contents only on datastoreQueue_
   std::atomic<std::uint32_t> currentGenCount_ = 0;          // raised only on datastoreQueue_
   std::atomic<std::uint64_t> notificationSeed_ = 0;
+  std::mutex changingList_;  // held while the list is compared, set and handed to publication
   platform::Guarded<platform::SharedBytes> currentData_;
   platform::Guarded<std::shared_ptr<const Localizations>> knownLoadedLocalizations_;
   platform::Once<std::unique_ptr<platform::SerialQueue>> publicationQueue_;

@@ -141,11 +141,12 @@ class InMemoryMessage : public platform::ConduitMessage {
       : contents_(std::move(contents)), wantsReply_(wantsReply), answer_(std::move(answer)) {}
   ~InMemoryMessage() override;
   const platform::PropertyListValue& contents() const override { return contents_; }
+  void discardContents() override { contents_ = platform::PropertyListDictionary(); }
   bool canReply() const override { return wantsReply_; }
   void reply(const platform::PropertyListValue& contents) override;
 
  private:
-  const platform::PropertyListValue contents_;
+  platform::PropertyListValue contents_;
   std::atomic<bool> wantsReply_;
   const std::shared_ptr<Answer> answer_;
 };

@@ -21,13 +21,14 @@ class ConduitServerMessage final : public ConduitMessage {
   ConduitServerMessage& operator=(const ConduitServerMessage&) = delete;
 
   const PropertyListValue& contents() const override { return contents_; }
+  void discardContents() override { contents_ = PropertyListDictionary(); }
   bool canReply() const override { return tag_ != 0 && !answered_; }
   void reply(const PropertyListValue& contents) override;
 
  private:
   const std::weak_ptr<ConduitServerConnection> connection_;
   const std::uint64_t tag_;
-  const PropertyListValue contents_;
+  PropertyListValue contents_;
   std::atomic<bool> answered_ = false;
 };
 
