@@ -110,7 +110,12 @@ void ConduitAcceptor::admit(OwnedDescriptor socket) {
                        ": closing the connection: it runs as another user");
     return;
   }
-  makeRoom();
+  if (!makeRoom()) {
+    if (!isFull_) context_.log.write("conduit: too many busy connections: closing new ones unserved");
+    isFull_ = true;
+    return;
+  }
+  isFull_ = false;
   const std::uint64_t age = ++lastConnection_;
   auto peer = LinuxPeerProcess::ofSocket(socket.get(), credentials.pid);
   const auto connection = std::make_shared<ConduitServerConnection>(
@@ -125,11 +130,13 @@ void ConduitAcceptor::admit(OwnedDescriptor socket) {
   handler_(std::shared_ptr<ConduitConnection>(connection));
 }
 
-void ConduitAcceptor::makeRoom() {
-  if (connections_.size() < mostConnections_) return;
+bool ConduitAcceptor::makeRoom() {
+  if (connections_.size() < mostConnections_) return true;
   const auto idle = std::find_if(connections_.begin(), connections_.end(),
                                  [](const auto& entry) { return entry.second->isIdle(); });
-  if (idle != connections_.end()) idle->second->refuse("there are too many");
+  if (idle == connections_.end()) return false;
+  idle->second->refuse("there are too many");
+  return true;
 }
 
 void ConduitAcceptor::rest() {

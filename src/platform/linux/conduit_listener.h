@@ -12,8 +12,8 @@ namespace kel::platform {
 /// Accepts the connections of one endpoint and owns them.
 ///
 /// Affinity: the listener's queue. Connections are accepted in bursts of bounded length; only processes with
-/// the server's own effective user id are served. When descriptors run out a connection is given up, the one
-/// that has been idle longest where there are too many, else the newest.
+/// the server's own effective user id are served. When descriptors run out a connection is given up, the
+/// oldest that is idle where there are too many, else the newest.
 class ConduitAcceptor : public std::enable_shared_from_this<ConduitAcceptor> {
  public:
   ConduitAcceptor(const ConduitServerContext& context, EndpointSocket endpoint, ConduitEventHandler handler);
@@ -30,7 +30,7 @@ class ConduitAcceptor : public std::enable_shared_from_this<ConduitAcceptor> {
   void acceptSome() KEL_RUNS_ON(loop_);
   Shortage giveUpOne() KEL_RUNS_ON(loop_);
   void admit(OwnedDescriptor socket) KEL_RUNS_ON(loop_);
-  void makeRoom() KEL_RUNS_ON(loop_);
+  bool makeRoom() KEL_RUNS_ON(loop_);
   void rest() KEL_RUNS_ON(loop_);
   void report(int error) KEL_RUNS_ON(loop_);
 
@@ -47,6 +47,7 @@ class ConduitAcceptor : public std::enable_shared_from_this<ConduitAcceptor> {
   std::uint64_t lastConnection_ KEL_ON(loop_) = 0;
   OwnedDescriptor reserve_ KEL_ON(loop_);  // given up to accept, and so to close, when there are no others
   bool isShort_ KEL_ON(loop_) = false;     // of descriptors, and the log says so
+  bool isFull_ KEL_ON(loop_) = false;      // new connections are closed, which is told once
 };
 
 /// The seam's listener: an acceptor for as long as it lives.

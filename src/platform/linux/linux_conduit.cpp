@@ -40,6 +40,7 @@ ConduitListening LinuxConduit::listen(std::string_view name, SerialQueue& queue,
   }
   listening.listener =
       std::make_unique<LinuxConduitListener>(context, std::move(*socket), std::move(handler));
+  if (tracksActivity_) environment_.trackActivity();
   return listening;
 }
 

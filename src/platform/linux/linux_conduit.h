@@ -10,8 +10,8 @@
 
 namespace kel::platform {
 
-/// The user's endpoints as Unix sockets in the runtime directory. Any thread. Borrows `log` and `clock`,
-/// which outlive every listener.
+/// The user's endpoints as Unix sockets in the runtime directory. `connect` from any thread, the rest while
+/// the server starts. Borrows `log` and `clock`, which outlive every listener.
 class LinuxConduit final : public Conduit {
  public:
   /// What the conduit is told by its surroundings; each is called when it is needed.
@@ -24,7 +24,8 @@ class LinuxConduit final : public Conduit {
   LinuxConduit(SystemLog& log, Clock& clock, Environment environment)
       : log_(log), clock_(clock), environment_(std::move(environment)) {}
 
-  void trackActivity() override { environment_.trackActivity(); }
+  /// Reports begin when an endpoint is served: only then is the server ready.
+  void trackActivity() override { tracksActivity_ = true; }
 
   /// With the launcher's socket, where it passed one for `name`; else binds the socket file. Before other
   /// threads use the environment.
@@ -35,6 +36,7 @@ class LinuxConduit final : public Conduit {
   SystemLog& log_;
   Clock& clock_;
   const Environment environment_;
+  bool tracksActivity_ = false;
 };
 
 }  // namespace kel::platform

@@ -56,7 +56,8 @@ class TemporaryFile {
     constexpr std::size_t longestStem = 200;  // leaves room below the longest name that a directory takes
     constexpr int attempts = 16;
     for (int attempt = 0; attempt < attempts; ++attempt) {
-      name_ = "." + wanted_.substr(0, longestStem) + "." + std::to_string(randomNumber());
+      name_ = '.';
+      name_.append(wanted_, 0, longestStem).append(1, '.').append(std::to_string(randomNumber()));
       file_ = openFile(directory_, name_, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, 0600);
       if (file_ || errno != EEXIST) break;
     }

@@ -31,7 +31,11 @@ std::string header() {
   localtime_r(&now, &local);
   char stamp[32] = "";
   std::strftime(stamp, sizeof stamp, "%b %e %H:%M:%S", &local);
-  return "<" + std::to_string(userFacility * 8 + notice) + ">" + stamp + " ";
+  return std::string("<")
+      .append(std::to_string(userFacility * 8 + notice))
+      .append(">")
+      .append(stamp)
+      .append(" ");
 }
 
 bool writeToStandardError(const std::string& line) {
@@ -66,6 +70,7 @@ std::string escapedForLog(std::string_view message) {
 }
 
 void LinuxSystemLog::write(std::string_view message) {
+  if (message.ends_with('\n')) message.remove_suffix(1);
   const std::uint64_t lost = lost_.exchange(0);
   std::string line = "kel[" + std::to_string(getpid()) + "]: " + escapedForLog(message);
   if (lost > 0) line += " [" + std::to_string(lost) + " message(s) before this one were lost]";

@@ -2,10 +2,12 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <fcntl.h>
 #include <stdio.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
 
 #include "platform/digest.h"
@@ -50,6 +52,16 @@ std::optional<NotificationRecord> readRecord(int directory, const std::string& f
       decodeNotificationRecord({reinterpret_cast<const std::uint8_t*>(text->data()), text->size()});
   if (!record) errno = EBADMSG;
   return record;
+}
+
+/// Holders keep the lock for microseconds; one that does not let go must not stop the caller.
+bool lockInTime(int lock) {
+  constexpr int attempts = 100;
+  for (int attempt = 0; flock(lock, LOCK_EX | LOCK_NB) != 0; ++attempt) {
+    if ((errno != EWOULDBLOCK && errno != EINTR) || attempt == attempts) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  return true;
 }
 
 bool replaceRecord(int directory, const std::string& file, const NotificationRecord& record) {
@@ -113,10 +125,7 @@ std::optional<std::string> NotificationStore::update(
   if (!directory) return errorLine(directory_, errno);
   const OwnedDescriptor lock =
       openFile(directory.get(), lockName, O_RDWR | O_CREAT | O_NOFOLLOW | O_NONBLOCK, 0600);
-  while (lock && flock(lock.get(), LOCK_EX) != 0) {
-    if (errno != EINTR) return errorLine(joinPath(directory_, lockName), errno);
-  }
-  if (!lock) return errorLine(joinPath(directory_, lockName), errno);
+  if (!lock || !lockInTime(lock.get())) return errorLine(joinPath(directory_, lockName), errno);
   NotificationRecord record = readRecord(directory.get(), *file).value_or(NotificationRecord());
   change(record);
   if (!replaceRecord(directory.get(), *file, record)) return errorLine(joinPath(directory_, *file), errno);
