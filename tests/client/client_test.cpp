@@ -3,7 +3,7 @@
 
 #include "client/command_line.h"
 #include "support/in_memory_platform.h"
-#include "support/print.h"
+#include "support/property_lists.h"
 
 namespace kel {
 namespace {
@@ -15,13 +15,10 @@ using platform::ConduitMessage;
 using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListValue;
+using test::dictionary;
 using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
-
-PropertyListDictionary dictionary(std::vector<PropertyListDictionary::Entry> entries) {
-  return PropertyListDictionary(std::move(entries));
-}
 
 TEST(ClassificationTest, TellsKindsApartByNameAndElse) {
   using enum KELCommand;

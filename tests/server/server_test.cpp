@@ -5,7 +5,7 @@
 
 #include "server/run_as_server.h"
 #include "support/in_memory_platform.h"
-#include "support/print.h"
+#include "support/property_lists.h"
 
 namespace kel {
 namespace {
@@ -17,6 +17,7 @@ using platform::ConduitReply;
 using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListValue;
+using test::dictionary;
 using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
@@ -28,11 +29,9 @@ constexpr const char* seedName = "user.uid.501.com.orvex.qvservices.seed";
 constexpr const char* cachePath = "/home/u/.cache/com.orvex.qvservicescache.plist";
 constexpr const char* bundle = "/home/u/Library/Services/one.service";
 
-PropertyListDictionary dictionary(std::vector<PropertyListDictionary::Entry> entries) {
-  return PropertyListDictionary(std::move(entries));
-}
-
 PropertyListValue request(const char* command) { return dictionary({{"command", command}}); }
+const PropertyListValue get = request("get_services_plist");
+const PropertyListValue update = request("get_and_update_services_plist");
 PropertyListValue debugRequest(const char* command) {
   return dictionary({{"command", command}, {"debug", true}});
 }
@@ -63,7 +62,7 @@ class ServerTest : public testing::Test {
   }
 
   /// Hands a request over as a connection would, without waiting for its answer.
-  Answer send(const PropertyListValue& contents, bool wantsReply = true) {
+  static Answer sendTo(KELServer& server, const PropertyListValue& contents, bool wantsReply = true) {
     auto answer = std::make_shared<test::InMemoryMessage::Answer>();
     const PropertyListDictionary& entries = *contents.asDictionary();
     server.conduitQueue().sync([&] {
@@ -74,28 +73,25 @@ class ServerTest : public testing::Test {
     });
     return answer;
   }
+  Answer send(const PropertyListValue& contents) { return sendTo(server, contents); }
+
+  /// Carries out a request and all that it queues.
+  void perform(const PropertyListValue& contents) {
+    send(contents)->wait();
+    drain();
+  }
 
   static PropertyListDictionary replyOf(const Answer& answer) {
     return *std::get<PropertyListValue>(answer->wait()).asDictionary();
   }
-
   static std::string debugOutput(const Answer& answer) {
     return *replyOf(answer).find("debug_output")->asString();
   }
-
-  /// The default titles of a reply's list, or "no data".
-  static std::vector<std::string> titles(const Answer& answer) {
-    const PropertyListDictionary reply = replyOf(answer);
-    const PropertyListValue* data = reply.find("data");
-    if (!data) return {"no data"};
-    std::vector<std::string> result;
-    const PropertyListValue list = *platform::readPropertyList(**data->asData()).value;
-    for (const PropertyListValue& service : *list.asArray()) {
-      result.push_back(
-          *service.asDictionary()->find("QVMenuItem")->asDictionary()->find("default")->asString());
-    }
-    return result;
+  static PropertyListValue listOf(const Answer& answer) {
+    return *platform::readPropertyList(**replyOf(answer).find("data")->asData()).value;
   }
+  static std::vector<std::string> titles(const Answer& answer) { return test::defaultTitles(listOf(answer)); }
+  std::vector<std::string> titles() { return titles(send(get)); }
 
   void react(void (KELServer::*reaction)()) {
     server.conduitQueue().sync([&] { (server.*reaction)(); });
@@ -121,51 +117,43 @@ class ServerTest : public testing::Test {
 };
 
 TEST_F(ServerTest, TheFirstRequestLoadsTheListAndQueuesAFullRebuildWhenTheCacheIsNotOfThisBoot) {
-  EXPECT_THAT(titles(send(request("get_services_plist"))), IsEmpty());
+  EXPECT_THAT(titles(), IsEmpty());
   drain();
-  EXPECT_THAT(titles(send(request("get_services_plist"))), ElementsAre("One"));
+  EXPECT_THAT(titles(), ElementsAre("One"));
   EXPECT_EQ(system.registry.queries, 1U);
 }
 
 TEST_F(ServerTest, ARestartAnswersFromACacheOfThisBootAndRebuildsNothing) {
-  send(request("get_and_update_services_plist"))->wait();
-  drain();
+  perform(update);
   server.sync(true, [](KELDataStore& store) { store.writeCaches(); });
   const std::size_t queries = system.registry.queries;
   {
     KELServer restarted(system.platform);
-    auto answer = std::make_shared<test::InMemoryMessage::Answer>();
-    restarted.conduitQueue().sync([&] {
-      restarted.conduitQueue().assertCurrent();
-      restarted.performCommand(KELCommand::KELCommandGetServicesPlist,
-                               std::make_shared<test::InMemoryMessage>(dictionary({}), true, answer), false,
-                               false);
-    });
-    EXPECT_THAT(titles(answer), ElementsAre("One"));
+    EXPECT_THAT(titles(sendTo(restarted, get)), ElementsAre("One"));
   }
   EXPECT_EQ(system.registry.queries, queries);
 }
 
 TEST_F(ServerTest, ACurrentListIsAnsweredWhileTheDataStoreIsBusy) {
-  send(request("get_and_update_services_plist"))->wait();
+  send(update)->wait();
   blockDataStore();
-  EXPECT_THAT(titles(send(request("get_services_plist"))), ElementsAre("One"));
+  EXPECT_THAT(titles(), ElementsAre("One"));
   EXPECT_THAT(titles(send(localizations({}))), ElementsAre("One"));
   release();
 }
 
 TEST_F(ServerTest, AStaleFlagGivesTheOldListAndTheNewOneNextTime) {
-  send(request("get_and_update_services_plist"))->wait();
+  send(update)->wait();
   addBundle(system.files, bundle, information("Changed"));
   system.journal.record(std::string(bundle) + "/Info.plist");
   react(&KELServer::reactToVigilChange);
   const std::uint64_t seedBefore = seed();
   blockDataStore();
-  EXPECT_THAT(titles(send(request("get_services_plist"))), ElementsAre("One"));
+  EXPECT_THAT(titles(), ElementsAre("One"));
   release();
   drain();
   EXPECT_GT(seed(), seedBefore) << "nobody was told to ask again";
-  EXPECT_THAT(titles(send(request("get_services_plist"))), ElementsAre("Changed"));
+  EXPECT_THAT(titles(), ElementsAre("Changed"));
 }
 
 TEST_F(ServerTest, UpdatesQueuedAgainstOneGenerationRebuildOnceAndAllWaitForIt) {
@@ -183,16 +171,15 @@ TEST_F(ServerTest, UpdatesQueuedAgainstOneGenerationRebuildOnceAndAllWaitForIt) 
 TEST_F(ServerTest, ANewLocalizationWaitsForARebuildThatAlwaysRuns) {
   addMenuStrings(system.files, bundle, "de", dictionary({{"One", "Eins"}}));
   blockDataStore();
-  const Answer update = send(request("get_and_update_services_plist"));
-  server.conduitQueue().async([] {});
+  const Answer updated = send(update);
   release();
-  update->wait();
+  updated->wait();
   blockDataStore();
   const Answer first = send(localizations({"de", "fr"}));
   const Answer debugged = send(debugRequest("get_and_update_services_plist"));
   EXPECT_FALSE(first->isThere());
   release();
-  const PropertyListValue list = *platform::readPropertyList(**replyOf(first).find("data")->asData()).value;
+  const PropertyListValue list = listOf(first);
   EXPECT_EQ(*list.asArray()->front().asDictionary()->find("QVMenuItem")->asDictionary()->find("de"), "Eins");
   EXPECT_THAT(debugOutput(debugged), HasSubstr("Coalescing")) << "the rebuild for de did not count";
   EXPECT_THAT(server.knownLoadedLocalizations(), ElementsAre("de"));
@@ -210,20 +197,20 @@ TEST_F(ServerTest, AFlushAnswersWithoutDataBeforeTheFileIsGoneAndTheNextGetLoads
   server.sync(true, [](KELDataStore& store) { store.writeCaches(); });
   drain();
   blockDataStore();
-  EXPECT_THAT(titles(send(request("flush"))), ElementsAre("no data"));
+  EXPECT_EQ(replyOf(send(request("flush"))), PropertyListDictionary());
   EXPECT_THAT(server.knownLoadedLocalizations(), IsEmpty());
   release();
   drain();
   EXPECT_FALSE(system.files.isFile(cachePath));
   EXPECT_EQ(*system.publication.publications().back().asDictionary()->find("KTVendedServices"),
             PropertyListArray{});
-  EXPECT_THAT(titles(send(request("get_services_plist"))), IsEmpty());
+  EXPECT_THAT(titles(), IsEmpty());
   drain();
-  EXPECT_THAT(titles(send(request("get_services_plist"))), ElementsAre("One"));
+  EXPECT_THAT(titles(), ElementsAre("One"));
 }
 
 TEST_F(ServerTest, OddRequestsAreCarriedOutOrAnsweredAllTheSame) {
-  send(request("get_and_update_services_plist"), false);
+  sendTo(server, update, false);
   drain();
   EXPECT_NE(server.currentData(), nullptr);
   EXPECT_THAT(titles(send(dictionary({{"command", "nonsense"}}))), ElementsAre("One"));
@@ -256,7 +243,7 @@ TEST_F(ServerTest, PublicationsComeInTheOrderOfTheChangesWithTheKnownLocalizatio
   send(localizations({"de"}))->wait();
   setLists(PropertyListArray{dictionary({{"last", true}})});
   system.platform.transactions.open();
-  while (system.transactions.openCount() > 1) drain();
+  while (system.transactions.openCount > 1) drain();
   system.platform.transactions.close();
   const std::vector<PropertyListValue> publications = system.publication.publications();
   ASSERT_THAT(publications, SizeIs(3));
@@ -287,62 +274,57 @@ class ReactorTest : public ServerTest {
  protected:
   /// What a request does with the flags: it clears them.
   void clearFlags() {
-    send(request("get_services_plist"))->wait();
-    drain();
+    perform(get);
     before = posts();
   }
   std::size_t newPosts() { return posts() - before; }
   void change() { react(&KELServer::reactToAppRegistryDatabaseChange); }
+  void advance(std::chrono::nanoseconds duration) {
+    system.clock.advance(duration);
+    drain();
+  }
 
   std::size_t before = 0;
 };
 
 TEST_F(ReactorTest, ABurstAfterQuietGivesOneReactionAtOnce) {
-  send(request("get_and_update_services_plist"))->wait();
+  perform(update);
   clearFlags();
   for (int i = 0; i < 10; ++i)
     server.conduitQueue().async([this] { server.reactToAppRegistryDatabaseChange(); });
   drain();
   EXPECT_EQ(newPosts(), 1U);
   change();
-  system.clock.advance(1h);
-  drain();
+  advance(1h);
   EXPECT_EQ(newPosts(), 1U) << "the flag was set, clients already know";
 }
 
-TEST_F(ReactorTest, AChangeSoonAfterAReactionIsAnsweredSixSecondsAfterIt) {
+TEST_F(ReactorTest, AChangeSoonAfterAReactionIsAnsweredSixSecondsAfterItAndAClockSetBackCountsAsNoTime) {
   change();
   clearFlags();
-  system.clock.advance(1s);
+  advance(1s);
   change();
   change();
-  system.clock.advance(5s - 1ms);
-  drain();
+  advance(5s - 1ms);
   EXPECT_EQ(newPosts(), 0U);
-  system.clock.advance(1ms);
-  drain();
+  advance(1ms);
   EXPECT_EQ(newPosts(), 1U);
-}
 
-TEST_F(ReactorTest, AClockSetBackCountsAsNoTimeElapsedAndALongQuietAsNoDelay) {
-  change();
   clearFlags();
   system.clock.setWallClock(10);
   change();
-  system.clock.advance(6s - 1ms);
-  drain();
+  advance(6s - 1ms);
   EXPECT_EQ(newPosts(), 0U);
-  system.clock.advance(1ms);
-  drain();
+  advance(1ms);
   EXPECT_EQ(newPosts(), 1U);
   clearFlags();
-  system.clock.advance(1h);
+  advance(1h);
   change();
-  EXPECT_EQ(newPosts(), 1U);
+  EXPECT_EQ(newPosts(), 1U) << "delayed after a long quiet";
 }
 
 TEST_F(ReactorTest, SeedingCompleteIsToldEveryTimeAndEachReactorMarksItsOwnFlag) {
-  send(request("get_and_update_services_plist"))->wait();
+  perform(update);
   clearFlags();
   const std::size_t queries = system.registry.queries;
   react(&KELServer::reactToAppRegistrySeedingComplete);
@@ -383,11 +365,11 @@ class RunAsServerTest : public testing::Test {
 TEST_F(RunAsServerTest, SubscribesToItsStreamsInOrderAndExitsOnTermination) {
   const int status = serve([this] {
     EXPECT_TRUE(system.conduit.tracksActivity);
-    EXPECT_THAT(system.launchEvents.streams(),
+    EXPECT_THAT(system.launchEvents.streams,
                 ElementsAre("com.orvex.beacond.matching", "com.orvex.broadcastd.matching",
                             "com.orvex.vigil.matching"));
     system.launchEvents.fire("com.orvex.broadcastd.matching");
-    ask(request("get_services_plist"));
+    ask(get);
     EXPECT_GE(system.seeds.postsOf(seedName), 2U);
     system.process.termination();
     EXPECT_EQ(system.process.exitStatus, 0);
@@ -406,9 +388,9 @@ TEST_F(RunAsServerTest, ASandboxedPeerGetsTheListAndIsRefusedTheRest) {
   system.sandbox.sandboxed = {7};
   system.sandbox.failing = {8};
   serve([this] {
-    const ConduitReply get = ask(debugRequest("get_services_plist"), 7);
-    ASSERT_EQ(failure(get), "answered");
-    EXPECT_EQ(std::get<PropertyListValue>(get).asDictionary()->find("debug_output"), nullptr);
+    const ConduitReply list = ask(debugRequest("get_services_plist"), 7);
+    ASSERT_EQ(failure(list), "answered");
+    EXPECT_EQ(std::get<PropertyListValue>(list).asDictionary()->find("debug_output"), nullptr);
     EXPECT_EQ(failure(ask(localizations({"de"}), 7)), "answered");
     EXPECT_EQ(failure(ask(request("flush"), 8)), "answered") << "a failed question means not sandboxed";
     EXPECT_THAT(system.log.take(), IsEmpty());
@@ -439,7 +421,7 @@ TEST_F(RunAsServerTest, ForeignMessagesCostOneLogLineEach) {
     }
     system.conduit.deliver(ConduitError{ConduitError::Kind::Other, "out of descriptors"});
     EXPECT_THAT(system.log.take(), ElementsAre("run_as_server: kel message error: out of descriptors"));
-    EXPECT_EQ(failure(ask(request("get_services_plist"))), "answered");
+    EXPECT_EQ(failure(ask(get)), "answered");
   });
   EXPECT_THAT(system.log.take(), IsEmpty()) << "a peer that went away was logged";
 }

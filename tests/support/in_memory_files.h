@@ -3,8 +3,10 @@
 #include <cstddef>
 #include <map>
 #include <optional>
+#include <stdexcept>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "platform/file_system.h"
@@ -12,65 +14,125 @@
 
 namespace kel::test {
 
-/// What was asked of one path.
-struct FileOperationCounts {
-  std::size_t listings = 0;
-  std::size_t existenceTests = 0;
-  std::size_t reads = 0;
-  std::size_t writes = 0;
-  std::size_t removals = 0;
-
-  bool operator==(const FileOperationCounts&) const = default;
-};
-
 /// A tree of files and directories in memory. Adding a file makes the directories above it; a trailing "/" of
 /// a path does not count. Any thread.
 class InMemoryFileSystem : public platform::FileSystem {
  public:
-  std::optional<std::vector<std::string>> listDirectory(const std::string& directory) override;
-  bool exists(const std::string& path) override;
-  platform::FileReading read(const std::string& path, std::size_t largest) override;
-  std::optional<std::string> writeAtomically(const std::string& path, platform::BytesView bytes) override;
-  std::optional<std::string> writePlainly(const std::string& path, platform::BytesView bytes) override;
-  bool remove(const std::string& path) override;
+  std::optional<std::vector<std::string>> listDirectory(const std::string& directory) override {
+    return state_.with([&](State& state) -> std::optional<std::vector<std::string>> {
+      const Node* node = state.use(directory);
+      if (!node || *node) return std::nullopt;
+      const std::string prefix = normalised(directory) + "/";
+      std::vector<std::string> names;
+      for (auto at = state.nodes.upper_bound(prefix); at != state.nodes.end(); ++at) {
+        if (!at->first.starts_with(prefix)) break;
+        std::string name = at->first.substr(prefix.size());
+        if (name.find('/') == std::string::npos) names.push_back(std::move(name));
+      }
+      return names;
+    });
+  }
+  bool exists(const std::string& path) override {
+    return state_.with([&](State& state) { return state.use(path) != nullptr; });
+  }
+  platform::FileReading read(const std::string& path, std::size_t largest) override {
+    return state_.with([&](State& state) -> platform::FileReading {
+      const Node* node = state.use(path);
+      if (!node) return {std::nullopt, "No such file or directory"};
+      if (!*node) return {std::nullopt, "not a regular file"};
+      if ((*node)->size() > largest) return {std::nullopt, "too large"};
+      return {*node, {}};
+    });
+  }
+  std::optional<std::string> writeAtomically(const std::string& path, platform::BytesView bytes) override {
+    return state_.with([&](State& state) {
+      state.use(path);
+      if (!state.nextWriteError) state.put(path, platform::Bytes(bytes.begin(), bytes.end()));
+      return std::exchange(state.nextWriteError, std::nullopt);
+    });
+  }
+  std::optional<std::string> writePlainly(const std::string& path, platform::BytesView bytes) override {
+    return writeAtomically(path, bytes);
+  }
+  bool remove(const std::string& path) override {
+    return state_.with([&](State& state) {
+      const Node* node = state.use(path);
+      return node && *node && state.nodes.erase(normalised(path)) == 1;
+    });
+  }
 
-  // Arranging the tree; none of these is counted.
-  void addFile(const std::string& path, platform::Bytes bytes);
-  void addText(const std::string& path, std::string_view text);
-  void addPropertyList(const std::string& path, const platform::PropertyListValue& value);
-  void addDirectory(const std::string& path);
-  void removeTree(const std::string& path);
+  // Arranging the tree and looking at it; none of these counts as a use.
+  void addFile(const std::string& path, platform::Bytes bytes) {
+    state_.with([&](State& state) { state.put(path, std::move(bytes)); });
+  }
+  void addText(const std::string& path, std::string_view text) {
+    addFile(path, platform::Bytes(text.begin(), text.end()));
+  }
+  void addPropertyList(const std::string& path, const platform::PropertyListValue& value) {
+    addFile(path, platform::writeBinaryPropertyList(value).bytes.value());
+  }
+  void addDirectory(const std::string& path) {
+    state_.with([&](State& state) { state.put(path, std::nullopt); });
+  }
+  void removeTree(const std::string& path) {
+    state_.with([&](State& state) {
+      std::erase_if(state.nodes, [prefix = path + "/"](const auto& node) {
+        return (node.first + "/").starts_with(prefix);
+      });
+    });
+  }
+  bool isDirectory(const std::string& path) {
+    return state_.with([&](State& state) { return state.find(path) && !*state.find(path); });
+  }
+  bool isFile(const std::string& path) { return contents(path).has_value(); }
+  std::optional<platform::Bytes> contents(const std::string& path) {
+    return state_.with([&](State& state) { return state.find(path) ? *state.find(path) : std::nullopt; });
+  }
 
-  // Looking at it; not counted either.
-  bool isDirectory(const std::string& path) const;
-  bool isFile(const std::string& path) const;
-  std::optional<platform::Bytes> contents(const std::string& path) const;
-  FileOperationCounts counts(const std::string& path) const;
-  void resetCounts();
+  /// How often `path` was listed, tested, read, written or removed, from the start or the last forgetting.
+  std::size_t uses(const std::string& path) {
+    return state_.with([&](State& state) { return state.uses[normalised(path)]; });
+  }
+  void forgetUses() {
+    state_.with([](State& state) { state.uses.clear(); });
+  }
 
   /// The next write fails with `error` and changes nothing.
-  void failNextWrite(std::string error = "No space left on device");
-
-  /// Reading, listing and writing `path` fail until the permission is given back; it still exists.
-  void setUnreadable(const std::string& path, bool unreadable = true);
+  void failNextWrite(std::string error) {
+    state_.with([&](State& state) { state.nextWriteError = std::move(error); });
+  }
 
  private:
-  struct Node {
-    std::optional<platform::Bytes> bytes;  ///< absent for a directory
-    bool unreadable = false;
-  };
+  using Node = std::optional<platform::Bytes>;  ///< absent for a directory
+
   struct State {
-    std::map<std::string, Node> nodes{{"/", {}}};
-    std::map<std::string, FileOperationCounts> counts;
+    std::map<std::string, Node> nodes;  ///< by normalised path
+    std::map<std::string, std::size_t> uses;
     std::optional<std::string> nextWriteError;
 
-    const Node* find(const std::string& normalised) const;
-    void makeDirectories(const std::string& normalised);
-    void put(const std::string& normalised, platform::Bytes bytes);
-    std::optional<std::string> write(const std::string& normalised, platform::BytesView bytes);
+    const Node* find(const std::string& path) const {
+      const auto found = nodes.find(normalised(path));
+      return found == nodes.end() ? nullptr : &found->second;
+    }
+    const Node* use(const std::string& path) {
+      ++uses[normalised(path)];
+      return find(path);
+    }
+    void put(const std::string& path, Node node) {
+      const std::string own = normalised(path);
+      for (auto slash = own.find('/', 1); slash != std::string::npos; slash = own.find('/', slash + 1)) {
+        if (nodes[own.substr(0, slash)]) throw std::logic_error("a file is in the way of " + path);
+      }
+      nodes[own] = std::move(node);
+    }
   };
 
-  mutable platform::Guarded<State> state_;
+  static std::string normalised(std::string path) {
+    while (path.ends_with('/')) path.pop_back();
+    return path;
+  }
+
+  platform::Guarded<State> state_;
 };
 
 }  // namespace kel::test

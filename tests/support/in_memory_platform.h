@@ -2,12 +2,11 @@
 
 #include "platform/platform.h"
 #include "support/in_memory_bundles.h"
+#include "support/in_memory_conduit.h"
 #include "support/in_memory_directories.h"
 #include "support/in_memory_files.h"
-#include "support/in_memory_publication.h"
 #include "support/in_memory_services.h"
 #include "support/manual_clock.h"
-#include "support/recording_log.h"
 
 namespace kel::test {
 

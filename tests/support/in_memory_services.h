@@ -1,6 +1,8 @@
 #pragma once
 
+#include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <deque>
 #include <functional>
@@ -15,80 +17,134 @@
 
 namespace kel::test {
 
-/// Facts that a test sets; random numbers come from a list, then count upwards.
+/// Facts that a test sets; random numbers come from a list, whose last one repeats.
 class InMemoryFacts : public platform::SystemFacts {
  public:
-  std::string buildVersion() override { return version; }
+  std::string buildVersion() override { return "linux 1"; }
   platform::SystemReading bootTime() override { return boot; }
   platform::SystemReading auditSession() override { return session; }
   std::uint32_t realUserID() override { return 501; }
-  std::uint32_t random32() override;
-  std::optional<std::string> environmentVariable(const std::string& name) override;
+  std::uint32_t random32() override {
+    const std::uint32_t number = randomNumbers.front();
+    if (randomNumbers.size() > 1) randomNumbers.pop_front();
+    return number;
+  }
+  std::optional<std::string> environmentVariable(const std::string& name) override {
+    return environment.contains(name) ? std::optional(environment[name]) : std::nullopt;
+  }
 
-  std::string version = "linux 1";
   platform::SystemReading boot{1700000000, 0, {}};
   platform::SystemReading session{100004, 0, {}};
-  std::deque<std::uint32_t> randomNumbers;
+  std::deque<std::uint32_t> randomNumbers{7};
   std::map<std::string, std::string> environment;
+};
+
+/// Keeps what is logged, whole and in order. Any thread.
+class RecordingLog : public platform::SystemLog {
+ public:
+  void write(std::string_view message) override {
+    messages_.with([&](auto& messages) { messages.emplace_back(message); });
+  }
+  /// The messages so far, which are forgotten.
+  std::vector<std::string> take() {
+    return messages_.with([](auto& messages) { return std::exchange(messages, {}); });
+  }
+
+ private:
+  platform::Guarded<std::vector<std::string>> messages_;
+};
+
+/// Keeps every publication; the last one is the preference that other processes read. Any thread.
+class InMemoryPublication : public platform::ServicesPublication, public platform::Preferences {
+ public:
+  void publish(const platform::PropertyListValue& publication) override {
+    publications_.with([&](auto& publications) { publications.push_back(publication); });
+  }
+  std::optional<platform::PropertyListValue> value(std::string_view domain, std::string_view key) override {
+    const std::vector<platform::PropertyListValue> all = publications();
+    const bool own = domain == "com.orvex.ServicesMenu.Services" && key == "QVServices";
+    return own && !all.empty() ? std::optional(all.back()) : std::nullopt;
+  }
+
+  std::vector<platform::PropertyListValue> publications() const { return publications_.copy(); }
+
+ private:
+  platform::Guarded<std::vector<platform::PropertyListValue>> publications_;
 };
 
 class CountingTransactions : public platform::Transactions {
  public:
-  void open() override;
-  void close() override;
-  std::int64_t openCount() const { return open_; }
-
- private:
-  std::atomic<std::int64_t> open_ = 0;
+  void open() override { ++openCount; }
+  void close() override { --openCount; }
+  std::atomic<int> openCount = 0;
 };
 
-/// Seeds in memory; posts are told to observers and counted. Any thread.
+/// Seeds in memory; posts are counted and reach nobody. Any thread.
 class InMemorySeeds : public platform::NotificationSeeds {
  public:
-  Token registerName(const std::string& name) override;
-  std::uint64_t state(Token token) override;
-  void setState(Token token, std::uint64_t state) override;
-  void post(const std::string& name) override;
-  std::unique_ptr<Observation> observe(const std::string& name, platform::SerialQueue& queue,
-                                       std::function<void()> posted) override;
+  Token registerName(const std::string& name) override {
+    return static_cast<Token>(std::hash<std::string>()(name));
+  }
+  std::uint64_t state(Token token) override {
+    return seeds_.with([&](auto& seeds) { return seeds[token].state; });
+  }
+  void setState(Token token, std::uint64_t state) override {
+    seeds_.with([&](auto& seeds) { seeds[token].state = state; });
+  }
+  void post(const std::string& name) override {
+    seeds_.with([&](auto& seeds) { ++seeds[registerName(name)].posts; });
+  }
+  std::unique_ptr<Observation> observe(const std::string&, platform::SerialQueue&,
+                                       std::function<void()>) override {
+    return nullptr;
+  }
 
   std::uint64_t stateOf(const std::string& name) { return state(registerName(name)); }
   void setStateOf(const std::string& name, std::uint64_t state) { setState(registerName(name), state); }
-  std::size_t postsOf(const std::string& name);
+  std::size_t postsOf(const std::string& name) {
+    return seeds_.with([&](auto& seeds) { return seeds[registerName(name)].posts; });
+  }
 
  private:
   struct Seed {
-    std::string name;
     std::uint64_t state = 0;
     std::size_t posts = 0;
   };
-  platform::Guarded<std::vector<Seed>> seeds_;
+  platform::Guarded<std::map<Token, Seed>> seeds_;
 };
 
 /// Streams that a test fires; the event at the start is left to the test.
 class InMemoryLaunchEvents : public platform::LaunchEvents {
  public:
   void setHandler(std::string_view stream, platform::SerialQueue& queue,
-                  std::function<void()> handler) override;
+                  std::function<void()> handler) override {
+    streams.emplace_back(stream);
+    handlers_[streams.back()] = [&queue, handler = std::move(handler)] { queue.async(handler); };
+  }
 
   /// Queues the stream's handler.
-  void fire(const std::string& stream);
-  std::vector<std::string> streams() const { return order_; }
+  void fire(const std::string& stream) { handlers_.at(stream)(); }
+
+  std::vector<std::string> streams;  ///< in the order of their handlers
 
  private:
-  std::vector<std::string> order_;
-  std::map<std::string, std::pair<platform::SerialQueue*, std::function<void()>>> handlers_;
+  std::map<std::string, std::function<void()>> handlers_;
 };
 
+/// Applications that provide services.
 class InMemoryRegistry : public platform::ApplicationRegistry {
  public:
-  std::vector<platform::RegisteredApplication> applications(std::uint32_t mask, std::uint32_t value) override;
+  std::vector<platform::RegisteredApplication> applications(std::uint32_t mask, std::uint32_t value) override {
+    ++queries;
+    if ((mask & value) != providesServices) return {};
+    return registered_;
+  }
+  void add(const std::string& path) { registered_.push_back({path}); }
 
-  std::vector<std::pair<platform::RegisteredApplication, std::uint32_t>>
-      registered;  ///< with information flags
   std::atomic<std::size_t> queries = 0;
 
-  void add(const std::string& path) { registered.push_back({{path}, providesServices}); }
+ private:
+  std::vector<platform::RegisteredApplication> registered_;
 };
 
 /// A journal in memory: replays what was recorded, and misbehaves on demand. One test thread arranges it.
@@ -97,15 +153,19 @@ class InMemoryJournal : public platform::EventJournal {
   platform::EventID currentEventID() override { return newest_; }
   std::unique_ptr<platform::JournalStream> createStream(platform::JournalCallback callback,
                                                         const std::vector<std::string>& paths,
-                                                        platform::EventID since,
-                                                        std::chrono::nanoseconds latency,
-                                                        std::uint32_t flags) override;
+                                                        platform::EventID since, std::chrono::nanoseconds,
+                                                        std::uint32_t flags) override {
+    creations.push_back({since, flags});
+    if (!available || (refuseWatchRoot && (flags & platform::stream_flags::watchRoot))) return nullptr;
+    return std::make_unique<Stream>(*this, std::move(callback), paths, since);
+  }
 
   /// Records an event at the next position.
-  void record(const std::string& path, std::uint32_t flags = 0);
+  void record(const std::string& path, std::uint32_t flags = 0) {
+    events_.push_back({path, flags, ++newest_});
+  }
 
   struct Creation {
-    std::vector<std::string> paths;
     platform::EventID since = 0;
     std::uint32_t flags = 0;
   };
@@ -118,71 +178,45 @@ class InMemoryJournal : public platform::EventJournal {
   std::atomic<int> liveStreams = 0;
 
  private:
-  friend class InMemoryStream;
+  class Stream : public platform::JournalStream {
+   public:
+    Stream(InMemoryJournal& journal, platform::JournalCallback callback, std::vector<std::string> paths,
+           platform::EventID since)
+        : journal_(journal), callback_(std::move(callback)), paths_(std::move(paths)), since_(since) {
+      ++journal_.liveStreams;
+    }
+    ~Stream() override { --journal_.liveStreams; }
+
+    void setQueue(platform::SerialQueue& queue) override { queue_ = &queue; }
+    bool start() override {
+      if (journal_.refuseStart) return false;
+      std::vector<platform::JournalEvent> batch;
+      for (const platform::JournalEvent& event : journal_.events_) {
+        const bool watched = std::any_of(paths_.begin(), paths_.end(), [&](const std::string& path) {
+          return event.path.starts_with(path) || path.starts_with(event.path);
+        });
+        if (event.eventID > since_ && watched) batch.push_back(event);
+      }
+      if (journal_.historyEnds) batch.push_back({"", platform::event_flags::historyDone, journal_.newest_});
+      queue_->async([callback = callback_, batch] { callback(batch); });
+      if (!journal_.afterHistory.empty()) {
+        queue_->async([callback = callback_, later = journal_.afterHistory] { callback(later); });
+      }
+      return true;
+    }
+    void stop() override {}
+    void invalidate() override {}
+
+   private:
+    InMemoryJournal& journal_;
+    platform::JournalCallback callback_;
+    std::vector<std::string> paths_;
+    platform::EventID since_;
+    platform::SerialQueue* queue_ = nullptr;
+  };
+
   platform::EventID newest_ = 1000;
   std::vector<platform::JournalEvent> events_;
-};
-
-/// A request made by hand. Its reply, or the error of a dropped request, can be waited for.
-class InMemoryMessage : public platform::ConduitMessage {
- public:
-  /// What became of the request; shared with the test.
-  struct Answer {
-    platform::Semaphore arrived;
-    platform::Guarded<std::optional<platform::ConduitReply>> reply;
-
-    void set(platform::ConduitReply value);
-    /// Waits, within a generous limit.
-    platform::ConduitReply wait();
-    bool isThere() const { return reply.copy().has_value(); }
-  };
-
-  InMemoryMessage(platform::PropertyListValue contents, bool wantsReply, std::shared_ptr<Answer> answer)
-      : contents_(std::move(contents)), wantsReply_(wantsReply), answer_(std::move(answer)) {}
-  ~InMemoryMessage() override;
-  const platform::PropertyListValue& contents() const override { return contents_; }
-  void discardContents() override { contents_ = platform::PropertyListDictionary(); }
-  bool canReply() const override { return wantsReply_; }
-  void reply(const platform::PropertyListValue& contents) override;
-
- private:
-  platform::PropertyListValue contents_;
-  std::atomic<bool> wantsReply_;
-  const std::shared_ptr<Answer> answer_;
-};
-
-/// Endpoints within the process: a connection's messages reach the listener on the listener's queue.
-class InMemoryConduit : public platform::Conduit {
- public:
-  void trackActivity() override { tracksActivity = true; }
-  platform::ConduitListening listen(std::string_view name, platform::SerialQueue& queue,
-                                    platform::ConduitEventHandler handler) override;
-  std::shared_ptr<platform::ConduitConnection> connect(std::string_view name,
-                                                       platform::SerialQueue& queue) override;
-
-  /// Delivers any event to the listener.
-  void deliver(const platform::ConduitEvent& event);
-
-  bool tracksActivity = false;
-  std::int64_t nextPeer = 4711;  ///< process id of the next connection's peer
-  std::atomic<int> connections = 0;
-
- private:
-  friend class InMemoryListener;
-  friend class InMemoryClientConnection;
-  struct Endpoint {
-    platform::SerialQueue* queue = nullptr;
-    platform::ConduitEventHandler handler;
-  };
-  platform::Guarded<std::shared_ptr<Endpoint>> endpoint_;
-};
-
-/// Knows the sandboxed processes by id; for the ids in `failing` the question fails.
-class InMemorySandbox : public platform::SandboxQuery {
- public:
-  int check(const platform::PeerProcess& process) override;
-  std::vector<std::int64_t> sandboxed;
-  std::vector<std::int64_t> failing;
 };
 
 /// A process whose main loop runs a test's work and then returns.

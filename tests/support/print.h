@@ -1,13 +1,13 @@
 #pragma once
 
-#include <iosfwd>
+#include <ostream>
 
-#include "platform/property_list_value.h"
+#include "platform/property_list.h"
 
 // How test failures show property-list values.
 namespace kel::platform {
 
-void PrintTo(const PropertyListValue& value, std::ostream* out);
-void PrintTo(const PropertyListDictionary& dictionary, std::ostream* out);
+inline void PrintTo(const PropertyListValue& value, std::ostream* out) { *out << describe(value); }
+inline void PrintTo(const PropertyListDictionary& value, std::ostream* out) { *out << describe(value); }
 
 }  // namespace kel::platform

@@ -1,0 +1,182 @@
+#include <gmock/gmock.h>
+#include <sstream>
+
+#include "restrictions/restriction_lists.h"
+#include "restrictions/whitelist_generator.h"
+#include "support/in_memory_platform.h"
+#include "support/property_lists.h"
+
+namespace kel {
+namespace {
+
+using platform::PropertyListDictionaryBuilder;
+using platform::PropertyListValue;
+using test::dictionary;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::SizeIs;
+using Array = platform::PropertyListArray;
+using Dictionary = platform::PropertyListDictionary;
+
+Dictionary row(PropertyListValue bundleID, PropertyListValue title) {
+  return dictionary({{"QVBundleID", std::move(bundleID)}, {"QVMenuItem", std::move(title)}});
+}
+
+Dictionary service(PropertyListValue bundleID, PropertyListValue titles) {
+  return dictionary({{"QVBundleIdentifier", std::move(bundleID)}, {"QVMenuItem", std::move(titles)}});
+}
+
+Dictionary titled(std::string_view bundleID, std::string_view title) {
+  return service(bundleID, dictionary({{"default", title}}));
+}
+
+std::optional<Dictionary> readAndStored(const Dictionary& lists) {
+  return restriction_lists_to_plist(restriction_lists_from_plist(lists).get());
+}
+
+TEST(RestrictionListsTest, EntriesAreEqualInBothStrings) {
+  const auto entry = KELRestrictionListEntry::initWithBundleID("com.orvex.A", "Menu/Item");
+  const auto otherBundle = KELRestrictionListEntry::initWithBundleID("com.orvex.B", "Menu/Item");
+  EXPECT_EQ(entry, KELRestrictionListEntry::initWithBundleID("com.orvex.A", "Menu/Item"));
+  EXPECT_NE(entry, otherBundle);
+  EXPECT_NE(entry, KELRestrictionListEntry::initWithBundleID("com.orvex.A", "menu/item"));
+  EXPECT_EQ(entry->hash(), otherBundle->hash()) << "the hash is the title's";
+}
+
+TEST(RestrictionListsTest, StorableFormKeepsOrderAndEmptinessAndLeavesOddRowsOut) {
+  EXPECT_FALSE(restriction_lists_from_plist(std::nullopt));
+  EXPECT_FALSE(restriction_lists_to_plist(nullptr));
+  EXPECT_EQ(readAndStored({}), dictionary({{"QVUnrestricted", Array{}}, {"QVRestricted", Array{}}}));
+  const auto stored = dictionary({{"QVUnrestricted", Array{row("b", "2"), row("a", "1")}},
+                                  {"QVRestricted", Array{row("c", "3"), row("c", "3")}}});
+  EXPECT_EQ(readAndStored(stored), stored);
+  const auto odd = dictionary({{"QVUnrestricted", "no array"},
+                               {"QVRestricted", Array{row("b", "2"), "no row", row(7, "3"), row("c", Array{}),
+                                                      dictionary({{"QVBundleID", "x"}}), row("a", "1")}}});
+  EXPECT_EQ(readAndStored(odd),
+            dictionary({{"QVUnrestricted", Array{}}, {"QVRestricted", Array{row("b", "2"), row("a", "1")}}}));
+}
+
+TEST(RestrictionListsTest, MarksWhatTheRulesRestrictAndNothingElse) {
+  const auto lists = restriction_lists_from_plist(
+      dictionary({{"QVUnrestricted",
+                   Array{row("com.orvex.A", "Free"), row("com.orvex.A", "Both"), row("org.other", "Free")}},
+                  {"QVRestricted", Array{row("com.orvex.A", "Both"), row("org.other", "Bound")}}}));
+  PropertyListDictionaryBuilder declared(titled("org.other", "Bound"));
+  declared.set("QVRestricted", false);
+  struct Row {
+    const char* name;
+    Dictionary service;
+    const KELRestrictionLists* lists;
+    std::optional<PropertyListValue> expected;  // under "QVRestricted"
+  };
+  const KELRestrictionLists* const own = lists.get();
+  for (const Row& c : {
+           Row{"vendor, unrestricted", titled("com.orvex.A", "Free"), own, {}},
+           Row{"vendor, in both lists", titled("com.orvex.A", "Both"), own, true},
+           Row{"vendor, other letter case", titled("com.orvex.A", "free"), own, true},
+           Row{"vendor, title of another bundle", titled("com.orvex.B", "Free"), own, true},
+           Row{"no vendor, other case of the prefix", titled("com.Orvex.A", "New"), own, {}},
+           Row{"no vendor, prefix without dot", titled("com.orvexample", "New"), own, {}},
+           Row{"other, unrestricted", titled("org.other", "Free"), own, {}},
+           Row{"other, restricted", titled("org.other", "Bound"), own, true},
+           Row{"declared false stands", declared.build(), own, false},
+           Row{"English title", service("com.orvex.A", dictionary({{"English", "Free"}})), own, {}},
+           Row{"default before English",
+               service("com.orvex.A", dictionary({{"default", "New"}, {"English", "Free"}})), own, true},
+           Row{"neither title", service("com.orvex.A", dictionary({{"German", "Neu"}})), own, {}},
+           Row{"no titles", dictionary({{"QVBundleIdentifier", "com.orvex.A"}}), own, {}},
+           Row{"titles of another kind", service("com.orvex.A", "New"), own, {}},
+           Row{"identifier of another kind", service(7, dictionary({{"default", "New"}})), own, {}},
+           Row{"vendor, no lists", titled("com.orvex.A", "Free"), nullptr, true},
+           Row{"other, no lists", titled("org.other", "Bound"), nullptr, {}},
+       }) {
+    std::vector<PropertyListDictionaryBuilder> services{PropertyListDictionaryBuilder(c.service)};
+    apply_restriction_lists(services, c.lists);
+    PropertyListDictionaryBuilder expected(c.service);
+    if (c.expected) expected.set("QVRestricted", *c.expected);
+    EXPECT_EQ(services[0].build(), expected.build()) << c.name;
+  }
+}
+
+TEST(RestrictionListsTest, FileIsReadAnewFromTheLastSystemLibraryDirectory) {
+  test::InMemoryPlatform system;
+  const auto load = [&] { return load_restrictions_file(system.files, system.directories); };
+  system.directories.set({.systemLibraries = {"/Old/Library", "/System/Library"}});
+  const std::string path = "/System/Library/CoreAgents/com.orvex.QVServicesRestrictions.plist";
+  EXPECT_FALSE(load()) << "missing file";
+  const auto contents = dictionary({{"QVRestricted", Array{row("a", "1")}}});
+  system.files.addPropertyList(path, contents);
+  EXPECT_EQ(load(), contents);
+  system.files.addPropertyList(path, Array{});
+  EXPECT_FALSE(load()) << "no dictionary";
+  system.directories.set({.systemLibraries = {}});
+  EXPECT_FALSE(load()) << "no library directory";
+}
+
+class WhitelistGeneratorTest : public testing::Test {
+ protected:
+  void publish(Array services) {
+    system.publication.publish(dictionary({{"KTVendedServices", std::move(services)}}));
+  }
+  std::string generate() {
+    std::ostringstream out;
+    generate_whitelist(system.platform, out);
+    return out.str();
+  }
+  Dictionary written() {
+    return platform::readDictionaryFile(system.files, file, platform::largestOwnFile).dictionary.value();
+  }
+
+  test::InMemoryPlatform system;
+  const std::string file = "/tmp/u/com.orvex.QVServicesRestrictions.plist";
+};
+
+TEST_F(WhitelistGeneratorTest, ListsVendorServicesInOrderWithoutTheBlacklistedOnes) {
+  const BlacklistRow& first = default_blacklist[0];
+  const BlacklistRow& last = default_blacklist[7];
+  publish({titled("com.orvex.B", "Two"), titled(first.bundleID, first.title), titled("org.other", "Three"),
+           "stray", titled("com.orvex.A", "One"), titled(first.bundleID, first.title),
+           titled("com.orvex.B", "Two"), dictionary({{"QVBundleIdentifier", "com.orvex.C"}}),
+           titled(last.bundleID, last.title)});
+  EXPECT_EQ(generate(), "Wrote to " + file + "\n");
+  const Array rows{row("com.orvex.B", "Two"), row("com.orvex.A", "One"), row("com.orvex.B", "Two")};
+  EXPECT_EQ(written(), dictionary({{"QVUnrestricted", rows}, {"QVRestricted", Array{}}}));
+  std::vector<std::string> expected;
+  for (const auto& [bundleID, title] : std::span(default_blacklist).subspan(1, 6)) {
+    expected.push_back("Blacklisted Service '" + std::string(bundleID) + ":" + std::string(title) +
+                       "' not found. Perhaps the blacklist needs to be updated?");
+  }
+  EXPECT_EQ(system.log.take(), expected);
+}
+
+TEST_F(WhitelistGeneratorTest, OddPublicationsGiveEmptyListsAndNoneNoFile) {
+  EXPECT_EQ(generate(),
+            "No services (com.orvex.ServicesMenu.Services missing or empty in QVServices preferences)\n");
+  for (const PropertyListValue& publication :
+       {PropertyListValue("text"), PropertyListValue(dictionary({{"KTVendedServices", "text"}}))}) {
+    system.publication.publish(publication);
+    EXPECT_EQ(generate(), "Wrote to " + file + "\n");
+    EXPECT_EQ(written(), dictionary({{"QVUnrestricted", Array{}}, {"QVRestricted", Array{}}}));
+    EXPECT_THAT(system.log.take(), SizeIs(8));
+  }
+  system.files.removeTree(file);
+  system.facts.environment["QVRunningFromWarden"] = "1";
+  EXPECT_EQ(generate(), "") << "under the launcher";
+  EXPECT_FALSE(system.files.isFile(file));
+}
+
+TEST_F(WhitelistGeneratorTest, FailureToWriteIsLogged) {
+  publish({});
+  system.files.failNextWrite("disk full");
+  EXPECT_EQ(generate(), "");
+  EXPECT_EQ(system.log.take().back(), "Unable to write to path '" + file + "': disk full");
+  system.directories.set({.temporary = std::nullopt});
+  EXPECT_EQ(generate(), "");
+  EXPECT_EQ(system.log.take().back(),
+            "Unable to write to path 'com.orvex.QVServicesRestrictions.plist': there is no safe temporary "
+            "directory");
+}
+
+}  // namespace
+}  // namespace kel
