@@ -33,7 +33,7 @@ def encode(message):
     return plistlib.dumps(message, fmt=plistlib.FMT_BINARY)
 
 
-def frame(payload, kind=REQUEST, tag=1, length=None):
+def frame(payload, kind=REQUEST, tag=7, length=None):
     return struct.pack(">IIQ", len(payload) if length is None else length, kind, tag) + payload
 
 
@@ -45,30 +45,28 @@ class Peer:
         self.socket.settimeout(30)
 
     def read(self, count):
+        """`count` bytes, or fewer when the other end has closed."""
         read = b""
-        while len(read) < count:
-            try:
-                more = self.socket.recv(count - len(read))
-            except ConnectionResetError:
-                return None
-            if not more:
-                return None
-            read += more
+        try:
+            while len(read) < count and (more := self.socket.recv(count - len(read))):
+                read += more
+        except ConnectionResetError:
+            pass
         return read
 
     def receive(self):
         """(kind, tag, contents) of the next frame; None when the other end has closed."""
-        if (header := self.read(16)) is None:
+        if len(header := self.read(16)) < 16:
             return None
         length, kind, tag = struct.unpack(">IIQ", header)
         payload = self.read(length)
         return kind, tag, plistlib.loads(payload) if payload else None
 
-    def ask(self, message, tag=7):
+    def ask(self, message):
         """The contents of the reply, or DROPPED."""
-        self.socket.sendall(frame(encode(message), tag=tag))
-        kind, answered, contents = self.receive()
-        assert answered == tag and kind in (REPLY, DROPPED)
+        self.socket.sendall(frame(encode(message)))
+        kind, tag, contents = self.receive()
+        assert tag == 7 and kind in (REPLY, DROPPED)
         return contents if kind == REPLY else DROPPED
 
 
@@ -92,13 +90,10 @@ class Home:
         }  # fmt: skip
         self.server = None
 
-    def put_examples(self):
-        shutil.copytree(EXAMPLES, self.home, dirs_exist_ok=True)
-
-    def put_bundle(self, name, title, **service):
+    def put_bundle(self, name, title):
         path = self.home / "Library" / "Services" / name
-        path.mkdir(parents=True, exist_ok=True)
-        declared = {"QVMessage": "go", "QVMenuItem": {"default": title}} | service
+        path.mkdir(parents=True)
+        declared = {"QVMessage": "go", "QVMenuItem": {"default": title}}
         (path / "Info.plist").write_bytes(encode({"KTBundleIdentifier": f"org.example.{name}", "QVServices": [declared]}))
 
     def spawn(self, **streams):
@@ -175,7 +170,7 @@ def home():
 @pytest.fixture
 def served(home):
     """The example bundles, a running server, and its first update done."""
-    home.put_examples()
+    shutil.copytree(EXAMPLES, home.home, dirs_exist_ok=True)
     home.start()
     home.ask(UPDATE)
     return home
