@@ -134,16 +134,11 @@ TEST_F(ServerTest, ARestartAnswersFromACacheOfThisBootAndRebuildsNothing) {
   EXPECT_EQ(system.registry.queries, queries);
 }
 
-TEST_F(ServerTest, ACurrentListIsAnsweredWhileTheDataStoreIsBusy) {
+TEST_F(ServerTest, TheListAtHandIsAnsweredAtOnceAndWhenStaleTheNewOneNextTime) {
   send(update)->wait();
   blockDataStore();
-  EXPECT_THAT(titles(), ElementsAre("One"));
   EXPECT_THAT(titles(send(localizations({}))), ElementsAre("One"));
   release();
-}
-
-TEST_F(ServerTest, AStaleFlagGivesTheOldListAndTheNewOneNextTime) {
-  send(update)->wait();
   addBundle(system.files, bundle, information("Changed"));
   system.journal.record(std::string(bundle) + "/Info.plist");
   react(&KELServer::reactToVigilChange);
@@ -170,10 +165,7 @@ TEST_F(ServerTest, UpdatesQueuedAgainstOneGenerationRebuildOnceAndAllWaitForIt) 
 
 TEST_F(ServerTest, ANewLocalizationWaitsForARebuildThatAlwaysRuns) {
   addMenuStrings(system.files, bundle, "de", dictionary({{"One", "Eins"}}));
-  blockDataStore();
-  const Answer updated = send(update);
-  release();
-  updated->wait();
+  perform(update);
   blockDataStore();
   const Answer first = send(localizations({"de", "fr"}));
   const Answer debugged = send(debugRequest("get_and_update_services_plist"));
@@ -185,11 +177,7 @@ TEST_F(ServerTest, ANewLocalizationWaitsForARebuildThatAlwaysRuns) {
   EXPECT_THAT(server.knownLoadedLocalizations(), ElementsAre("de"));
   blockDataStore();
   EXPECT_TRUE(send(localizations({"de", "xx"}))->isThere());
-  const Answer french = send(localizations({"fr"}));
-  EXPECT_FALSE(french->isThere());
   release();
-  french->wait();
-  EXPECT_THAT(server.knownLoadedLocalizations(), ElementsAre("de", "fr"));
 }
 
 TEST_F(ServerTest, AFlushAnswersWithoutDataBeforeTheFileIsGoneAndTheNextGetLoadsAgain) {
@@ -202,8 +190,6 @@ TEST_F(ServerTest, AFlushAnswersWithoutDataBeforeTheFileIsGoneAndTheNextGetLoads
   release();
   drain();
   EXPECT_FALSE(system.files.isFile(cachePath));
-  EXPECT_EQ(*system.publication.publications().back().asDictionary()->find("KTVendedServices"),
-            PropertyListArray{});
   EXPECT_THAT(titles(), IsEmpty());
   drain();
   EXPECT_THAT(titles(), ElementsAre("One"));
@@ -406,18 +392,13 @@ TEST_F(RunAsServerTest, ASandboxedPeerGetsTheListAndIsRefusedTheRest) {
 
 TEST_F(RunAsServerTest, ForeignMessagesCostOneLogLineEach) {
   serve([this] {
-    struct Case {
-      PropertyListValue message;
-      const char* line;
-    };
-    for (const Case& c : {
-             Case{request("nonsense"), "accept_conduit_connection: unknown Conduit message: .*nonsense.*"},
-             Case{localizations({"de", 1}), "accept_conduit_connection: unknown Conduit message: .*"},
-             Case{"text",
-                  "accept_conduit_connection: unknown Conduit message type 0x[0-9a-f]+ for event: text\n"},
-         }) {
-      EXPECT_EQ(failure(ask(c.message)), "Connection interrupted");
-      EXPECT_THAT(system.log.take(), ElementsAre(MatchesRegex(c.line)));
+    const std::string unknown = "accept_conduit_connection: unknown Conduit message";
+    for (const auto& [message, line] : std::vector<std::pair<PropertyListValue, std::string>>{
+             {request("nonsense"), unknown + ": .*nonsense.*"},
+             {localizations({"de", 1}), unknown + ": .*"},
+             {"text", unknown + " type 0x[0-9a-f]+ for event: text\n"}}) {
+      EXPECT_EQ(failure(ask(message)), "Connection interrupted");
+      EXPECT_THAT(system.log.take(), ElementsAre(MatchesRegex(line)));
     }
     system.conduit.deliver(ConduitError{ConduitError::Kind::Other, "out of descriptors"});
     EXPECT_THAT(system.log.take(), ElementsAre("run_as_server: kel message error: out of descriptors"));

@@ -72,7 +72,7 @@ class InMemoryConduit : public platform::Conduit {
   }
   std::shared_ptr<platform::ConduitConnection> connect(std::string_view, platform::SerialQueue&) override {
     ++connections;
-    return std::make_shared<ClientConnection>(endpoint_.copy(), nextPeer);
+    return std::make_shared<Connection>(endpoint_.copy(), nextPeer);
   }
 
   /// Delivers any event to the listener.
@@ -103,47 +103,29 @@ class InMemoryConduit : public platform::Conduit {
     const std::int64_t id;
   };
 
-  /// The server's end of a connection; on the listener's queue.
-  class AcceptedConnection : public platform::ConduitConnection {
+  /// Either end of a connection; that of the server, on the listener's queue, is the client's far end.
+  class Connection : public platform::ConduitConnection {
    public:
-    explicit AcceptedConnection(std::int64_t processID) : peer_(std::make_shared<Peer>(processID)) {}
+    explicit Connection(std::int64_t processID) : peer_(std::make_shared<Peer>(processID)) {}
+    Connection(std::shared_ptr<Endpoint> endpoint, std::int64_t processID)
+        : endpoint_(std::move(endpoint)), far_(std::make_shared<Connection>(processID)) {}
+    ~Connection() override {
+      if (endpoint_) endpoint_->queue.async([far = far_] { far->handler_(invalid()); });
+    }
     std::shared_ptr<const platform::PeerProcess> peer() const override { return peer_; }
     void setEventHandler(platform::ConduitEventHandler handler) override { handler_ = std::move(handler); }
-    void start() override { started_ = true; }
-    platform::ConduitReply sendAndWait(const platform::PropertyListValue&) override {
-      throw std::logic_error("the server's end sends no requests");
-    }
-    void deliver(const platform::ConduitEvent& event) const {
-      if (!started_ || !handler_) throw std::logic_error("an event for a connection that was not started");
-      handler_(event);
-    }
-
-   private:
-    const std::shared_ptr<Peer> peer_;
-    platform::ConduitEventHandler handler_;
-    bool started_ = false;
-  };
-
-  class ClientConnection : public platform::ConduitConnection {
-   public:
-    ClientConnection(std::shared_ptr<Endpoint> endpoint, std::int64_t processID)
-        : endpoint_(std::move(endpoint)), accepted_(std::make_shared<AcceptedConnection>(processID)) {}
-    ~ClientConnection() override {
-      if (endpoint_) endpoint_->queue.async([accepted = accepted_] { accepted->deliver(invalid()); });
-    }
-    std::shared_ptr<const platform::PeerProcess> peer() const override { return nullptr; }
-    void setEventHandler(platform::ConduitEventHandler) override {}
     void start() override {
-      if (!endpoint_) return;
-      endpoint_->queue.async([endpoint = endpoint_, accepted = accepted_] { endpoint->handler(accepted); });
+      started_ = true;
+      if (endpoint_) endpoint_->queue.async([to = endpoint_, far = far_] { to->handler(far); });
     }
     platform::ConduitReply sendAndWait(const platform::PropertyListValue& contents) override {
       if (!endpoint_) return invalid();
       auto answer = std::make_shared<InMemoryMessage::Answer>();
-      endpoint_->queue.async(
-          [accepted = accepted_, message = std::make_shared<InMemoryMessage>(contents, true, answer)] {
-            accepted->deliver(message);
-          });
+      auto message = std::make_shared<InMemoryMessage>(contents, true, answer);
+      endpoint_->queue.async([far = far_, message = std::move(message)] {
+        if (!far->started_) throw std::logic_error("a message for a connection that was not started");
+        far->handler_(message);
+      });
       return answer->wait();
     }
 
@@ -152,8 +134,11 @@ class InMemoryConduit : public platform::Conduit {
       return {platform::ConduitError::Kind::ConnectionInvalid, "Connection invalid"};
     }
 
-    const std::shared_ptr<Endpoint> endpoint_;
-    const std::shared_ptr<AcceptedConnection> accepted_;
+    const std::shared_ptr<Endpoint> endpoint_;  ///< the client's end only, and only when a server listens
+    const std::shared_ptr<Connection> far_;
+    const std::shared_ptr<const Peer> peer_;
+    platform::ConduitEventHandler handler_;
+    bool started_ = false;
   };
 
   platform::Guarded<std::shared_ptr<Endpoint>> endpoint_;

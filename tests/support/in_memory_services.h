@@ -134,7 +134,8 @@ class InMemoryLaunchEvents : public platform::LaunchEvents {
 /// Applications that provide services.
 class InMemoryRegistry : public platform::ApplicationRegistry {
  public:
-  std::vector<platform::RegisteredApplication> applications(std::uint32_t mask, std::uint32_t value) override {
+  std::vector<platform::RegisteredApplication> applications(std::uint32_t mask,
+                                                            std::uint32_t value) override {
     ++queries;
     if ((mask & value) != providesServices) return {};
     return registered_;
