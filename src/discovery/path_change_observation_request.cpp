@@ -24,7 +24,8 @@ bool KELPathChangeObservationRequest::runWithPaths(const std::vector<std::string
   eventStream_ =
       journal_.createStream(std::move(callback), paths, streamID, std::chrono::nanoseconds::zero(), flags);
   if (!eventStream_) return false;
-  eventStream_->setQueue(queue_);
+  if (!queue_) queue_.emplace("kel VigilStream");
+  eventStream_->setQueue(*queue_);
   if (!eventStream_->start()) {
     eventStream_->invalidate();
     eventStream_.reset();
@@ -39,7 +40,7 @@ bool KELPathChangeObservationRequest::runWithPaths(const std::vector<std::string
 }
 
 void KELPathChangeObservationRequest::receive(const std::vector<JournalEvent>& events) {
-  queue_.assertCurrent();
+  queue_->assertCurrent();
   if (finished_) return;
   for (const JournalEvent& event : events) {
     if (event.flags & event_flags::eventIDsWrapped) {
@@ -58,7 +59,7 @@ void KELPathChangeObservationRequest::receive(const std::vector<JournalEvent>& e
 
 void KELPathChangeObservationRequest::stop() {
   if (!eventStream_) return;
-  queue_.sync([this] {
+  queue_->sync([this] {
     eventStream_->stop();
     eventStream_->invalidate();
   });

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -42,7 +43,7 @@ class KELPathChangeObservationRequest : public std::enable_shared_from_this<KELP
 
   platform::EventJournal& journal_;
   std::unique_ptr<platform::JournalStream> eventStream_;
-  platform::SerialQueue queue_{"kel VigilStream"};
+  std::optional<platform::SerialQueue> queue_;  // made with the stream: a journal may have none to give
   platform::Semaphore waiter_;
 
   // Written on queue_ until the semaphore is signalled, read by the waiting thread afterwards.
