@@ -6,9 +6,10 @@
 #include <sys/epoll.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
-#include <system_error>
 #include <unistd.h>
 #include <utility>
+
+#include "platform/linux/files.h"
 
 namespace kel::platform {
 
@@ -152,7 +153,7 @@ void ConduitAcceptor::rest() {
 }
 
 void ConduitAcceptor::report(int error) {
-  handler_(ConduitError{ConduitError::Kind::Other, std::generic_category().message(error)});
+  handler_(ConduitError{ConduitError::Kind::Other, errorText(error)});
 }
 
 LinuxConduitListener::LinuxConduitListener(const ConduitServerContext& context, EndpointSocket endpoint,

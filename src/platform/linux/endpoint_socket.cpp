@@ -1,31 +1,21 @@
 #include "platform/linux/endpoint_socket.h"
 
-#include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
-#include <system_error>
 #include <unistd.h>
 #include <utility>
+
+#include "platform/linux/files.h"
+#include "platform/linux/unix_address.h"
 
 namespace kel::platform {
 
 namespace {
 
-std::optional<sockaddr_un> socketAddress(const std::string& path) {
-  sockaddr_un address{};
-  if (path.empty() || path.size() >= sizeof address.sun_path) return std::nullopt;
-  address.sun_family = AF_UNIX;
-  std::copy(path.begin(), path.end(), address.sun_path);
-  return address;
-}
-
-EndpointBinding failed(const std::string& path) {
-  return {std::nullopt, false, path + ": " + std::generic_category().message(errno)};
-}
+EndpointBinding failed(const std::string& path) { return {std::nullopt, false, errorLine(path, errno)}; }
 
 EndpointBinding servedElsewhere(const std::string& path) {
   return {std::nullopt, true, path + ": another server holds the endpoint"};
@@ -49,12 +39,12 @@ Occupant occupant(const std::string& path) {
 /// Bound and listening, reachable for the user alone whatever the file-creation mask.
 OwnedDescriptor bindAndListen(const std::string& path) {
   OwnedDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-  const auto address = socketAddress(path);
+  const auto address = unixAddress(path);
   if (!address) errno = ENAMETOOLONG;
   // The socket's own mode is what its file is made with.
   if (!socket || !address || fchmod(socket.get(), 0600) != 0 ||
-      bind(socket.get(), reinterpret_cast<const sockaddr*>(&*address), sizeof *address) != 0 ||
-      chmod(path.c_str(), 0600) != 0 || listen(socket.get(), SOMAXCONN) != 0) {
+      bind(socket.get(), address->get(), address->length) != 0 || chmod(path.c_str(), 0600) != 0 ||
+      listen(socket.get(), SOMAXCONN) != 0) {
     return {};
   }
   return socket;
@@ -93,14 +83,14 @@ EndpointBinding bindEndpoint(const std::string& path) {
 }
 
 OwnedDescriptor connectToEndpoint(const std::string& path, int flags) {
-  const auto address = socketAddress(path);
+  const auto address = unixAddress(path);
   if (!address) {
     errno = ENAMETOOLONG;
     return {};
   }
   OwnedDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | flags, 0));
   if (!socket) return {};
-  while (connect(socket.get(), reinterpret_cast<const sockaddr*>(&*address), sizeof *address) != 0) {
+  while (connect(socket.get(), address->get(), address->length) != 0) {
     if (errno == EINTR) continue;
     const int error = errno;
     socket.reset();

@@ -37,8 +37,9 @@ struct EndpointBinding {
   std::string error;             ///< one line, when there is no socket
 };
 
-/// Binds `path`, a socket file in a directory that only the user may write to. A lock file beside it keeps
-/// other servers out for the socket's life; the file that a dead server left is replaced, a live one's never.
+/// Binds `path`, absolute, a socket file in a directory that only the user may write to. A lock file beside
+/// it keeps other servers out for the socket's life; the file that a dead server left is replaced, a live
+/// one's never.
 EndpointBinding bindEndpoint(const std::string& path);
 
 /// The sockets that the service launcher passed to this process, in consecutive descriptors.

@@ -1,11 +1,11 @@
 #include "platform/linux/files.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
 #include <fcntl.h>
 #include <sys/random.h>
-#include <sys/stat.h>
 
 namespace kel::platform {
 
@@ -40,27 +40,45 @@ bool writeWhole(int descriptor, BytesView bytes) {
   return true;
 }
 
-std::optional<std::string> readSmallFile(int directory, const std::string& path, std::size_t largest) {
+bool isRegularFile(int descriptor, struct stat& status) {
+  if (fstat(descriptor, &status) != 0) return false;
+  if (S_ISREG(status.st_mode)) return true;
+  errno = S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
+  return false;
+}
+
+std::optional<Bytes> readFile(int directory, const std::string& path, std::size_t largest) {
   const OwnedDescriptor file = openFile(directory, path, O_RDONLY | O_NONBLOCK | O_NOCTTY);
   struct stat status {};
-  if (!file || fstat(file.get(), &status) != 0) return std::nullopt;
-  if (!S_ISREG(status.st_mode)) {
-    errno = EINVAL;
-    return std::nullopt;
-  }
-  std::string text;
-  for (;;) {
-    char buffer[4096];
-    const ssize_t count = read(file.get(), buffer, sizeof buffer);
+  if (!file || !isRegularFile(file.get(), status)) return std::nullopt;
+  const auto size = static_cast<std::size_t>(status.st_size);
+  std::size_t length = 0;
+  Bytes bytes(std::min(size, largest) + 1);
+  while (size <= largest && length <= largest) {
+    const ssize_t count = read(file.get(), bytes.data() + length, bytes.size() - length);
     if (count < 0 && errno == EINTR) continue;
     if (count < 0) return std::nullopt;
-    if (count == 0) return text;
-    text.append(buffer, static_cast<std::size_t>(count));
-    if (text.size() > largest) {
-      errno = EFBIG;
-      return std::nullopt;
+    length += static_cast<std::size_t>(count);
+    // Stopping at the stated size spares the call that would only say that this was the end.
+    if (count == 0 || (length == size && length < bytes.size() && size > 0)) {
+      bytes.resize(length);
+      return bytes;
     }
+    if (length == bytes.size()) bytes.resize(std::min(largest + 1, length * 2 + 4096));
   }
+  errno = EFBIG;
+  return std::nullopt;
+}
+
+std::optional<std::string> readSmallFile(int directory, const std::string& path, std::size_t largest) {
+  const auto bytes = readFile(directory, path, largest);
+  return bytes ? std::optional(std::string(bytes->begin(), bytes->end())) : std::nullopt;
+}
+
+DirectoryListing openListing(const std::string& path) {
+  if (path.find('\0') == std::string::npos) return DirectoryListing(opendir(path.c_str()));
+  errno = EINVAL;
+  return nullptr;
 }
 
 bool makeDirectories(const std::string& path) {

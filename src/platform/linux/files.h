@@ -2,8 +2,11 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <dirent.h>
+#include <memory>
 #include <optional>
 #include <string>
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include "platform/bytes.h"
@@ -25,9 +28,27 @@ OwnedDescriptor openFile(int directory, const std::string& path, int flags, mode
 /// Writes all of `bytes`, however often the kernel takes only a part.
 bool writeWhole(int descriptor, BytesView bytes);
 
-/// The whole text of a small file of the system, also of one that states no size; a longer one than `largest`
-/// fails with EFBIG, what is no regular file with EINVAL.
+/// Reads a whole regular file, also one of the system's that states no size, without ever waiting for one. A
+/// longer one than `largest` fails with EFBIG, a directory with EISDIR, what else is no regular file with
+/// EINVAL.
+std::optional<Bytes> readFile(int directory, const std::string& path, std::size_t largest);
+
+/// The same as text, for the small files of the system.
 std::optional<std::string> readSmallFile(int directory, const std::string& path, std::size_t largest = 65536);
+
+/// True when `descriptor` is that of a regular file, whose status is then in `status`; else fails as
+/// `readFile`.
+bool isRegularFile(int descriptor, struct stat& status);
+
+struct CloseDirectory {
+  void operator()(DIR* directory) const { closedir(directory); }
+};
+
+/// The entries of a directory, to be had with `readdir`; null when it cannot be read.
+using DirectoryListing = std::unique_ptr<DIR, CloseDirectory>;
+
+/// Lists `path`; one that holds a NUL fails with EINVAL.
+DirectoryListing openListing(const std::string& path);
 
 /// Makes `path` and its missing parents, mode 0700.
 bool makeDirectories(const std::string& path);

@@ -1,11 +1,8 @@
 #include "platform/linux/linux_application_registry.h"
 
 #include <algorithm>
-#include <dirent.h>
 #include <fcntl.h>
-#include <memory>
 #include <string_view>
-#include <sys/stat.h>
 
 #include "platform/linux/files.h"
 #include "platform/unicode.h"
@@ -13,10 +10,6 @@
 namespace kel::platform {
 
 namespace {
-
-struct CloseDirectory {
-  void operator()(DIR* directory) const { closedir(directory); }
-};
 
 /// Walks one application directory. Recursion ends at the depth limit, the whole walk at the folder limit.
 class ApplicationScan {
@@ -42,7 +35,7 @@ class ApplicationScan {
  private:
   /// Notes the applications in `folder` and returns its plain subfolders: none when it is itself a bundle.
   std::vector<std::string> list(const std::string& folder, int depth) {
-    const std::unique_ptr<DIR, CloseDirectory> listing(opendir(folder.c_str()));
+    const DirectoryListing listing = openListing(folder);
     std::vector<std::string> found;
     std::vector<std::string> subfolders;
     while (const dirent* entry = listing ? readdir(listing.get()) : nullptr) {

@@ -2,12 +2,9 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <dirent.h>
 #include <fcntl.h>
-#include <memory>
 #include <stdio.h>
 #include <string_view>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include "platform/linux/files.h"
@@ -16,38 +13,6 @@
 namespace kel::platform {
 
 namespace {
-
-struct CloseDirectory {
-  void operator()(DIR* directory) const { closedir(directory); }
-};
-
-bool isRegular(int descriptor, struct stat& status) {
-  if (fstat(descriptor, &status) != 0) return false;
-  if (S_ISREG(status.st_mode)) return true;
-  errno = S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
-  return false;
-}
-
-/// Reads to the end of the file, whose size at the time of opening was `size`.
-bool readToEnd(int descriptor, std::size_t size, std::size_t largest, Bytes& bytes) {
-  std::size_t length = 0;
-  bytes.resize(std::min(size, largest) + 1);
-  for (;;) {
-    const ssize_t count = ::read(descriptor, bytes.data() + length, bytes.size() - length);
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0) return false;
-    length += static_cast<std::size_t>(count);
-    if (length > largest) {
-      errno = EFBIG;
-      return false;
-    }
-    // Stopping at the stated size spares the call that would only say that this was the end.
-    if (count == 0 || (length == size && length < bytes.size() && size > 0)) break;
-    if (length == bytes.size()) bytes.resize(std::min(largest + 1, length * 2 + 4096));
-  }
-  bytes.resize(length);
-  return true;
-}
 
 /// A file under a name of its own that becomes the one wanted by `replace`, or vanishes.
 class TemporaryFile {
@@ -92,8 +57,7 @@ class TemporaryFile {
 }  // namespace
 
 std::optional<std::vector<std::string>> LinuxFileSystem::listDirectory(const std::string& directory) {
-  if (directory.find('\0') != std::string::npos) return std::nullopt;
-  const std::unique_ptr<DIR, CloseDirectory> listing(opendir(directory.c_str()));
+  const DirectoryListing listing = openListing(directory);
   if (!listing) return std::nullopt;
   std::vector<std::string> names;
   std::size_t unreadable = 0;
@@ -122,17 +86,8 @@ bool LinuxFileSystem::exists(const std::string& path) {
 }
 
 FileReading LinuxFileSystem::read(const std::string& path, std::size_t largest) {
-  const OwnedDescriptor file = openFile(AT_FDCWD, path, O_RDONLY | O_NONBLOCK | O_NOCTTY);
-  struct stat status {};
-  if (!file) return {std::nullopt, errorLine(path, errno)};
-  if (!isRegular(file.get(), status)) {
-    return {std::nullopt, errno == EINVAL ? path + ": not a regular file" : errorLine(path, errno)};
-  }
-  const auto size = static_cast<std::size_t>(status.st_size);
-  Bytes bytes;
-  if (size > largest || !readToEnd(file.get(), size, largest, bytes)) {
-    return {std::nullopt, errorLine(path, size > largest ? EFBIG : errno)};
-  }
+  auto bytes = readFile(AT_FDCWD, path, largest);
+  if (!bytes) return {std::nullopt, errno == EINVAL ? path + ": not a regular file" : errorLine(path, errno)};
   return {std::move(bytes), {}};
 }
 
@@ -155,7 +110,7 @@ std::optional<std::string> LinuxFileSystem::writePlainly(const std::string& path
   const OwnedDescriptor file =
       openFile(AT_FDCWD, path, O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY, 0600);
   struct stat status {};
-  if (!file || !isRegular(file.get(), status) || ftruncate(file.get(), 0) != 0 ||
+  if (!file || !isRegularFile(file.get(), status) || ftruncate(file.get(), 0) != 0 ||
       !writeWhole(file.get(), bytes) || fsync(file.get()) != 0) {
     return errorLine(path, errno);
   }

@@ -5,6 +5,7 @@
 #include <pthread.h>
 #include <semaphore.h>
 #include <stdio.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include "platform/linux/thread.h"
@@ -35,7 +36,13 @@ void handleSignal(int number, void (*handler)(int)) {
 
 }  // namespace
 
-LinuxProcess::LinuxProcess() { handleSignal(SIGPIPE, SIG_IGN); }
+LinuxProcess::LinuxProcess() {
+  handleSignal(SIGPIPE, SIG_IGN);
+  rlimit descriptors{};
+  if (getrlimit(RLIMIT_NOFILE, &descriptors) != 0) return;
+  descriptors.rlim_cur = descriptors.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &descriptors);
+}
 
 void LinuxProcess::onTermination(Task handler) {
   sem_init(&terminationSignals(), 0, 0);

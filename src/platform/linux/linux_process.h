@@ -6,8 +6,10 @@ namespace kel::platform {
 
 /// This process. One object at a time; used from the main thread but for `exitNow`.
 ///
-/// Making it lets writes to closed pipes and sockets fail instead of ending the process. The termination
-/// signal keeps its default effect until `onTermination`, so that a client can be ended like any program.
+/// Making it lets writes to closed pipes and sockets fail instead of ending the process, and lets the process
+/// have as many descriptors as it is entitled to: the usual limit is kept low for the sake of programs that
+/// wait with `select`, which this one never does. The termination signal keeps its default effect until
+/// `onTermination`, so that a client can be ended like any program.
 class LinuxProcess final : public Process {
  public:
   LinuxProcess();

@@ -8,6 +8,7 @@
 
 #include "platform/file_system.h"
 #include "platform/linux/files.h"
+#include "platform/linux/runtime_directory.h"
 
 namespace kel::platform {
 
@@ -38,14 +39,6 @@ bool isSafeForTemporaryFiles(const std::string& path) {
   return (status.st_mode & (S_IWGRP | S_IWOTH)) == 0 || (status.st_mode & S_ISVTX) != 0;
 }
 
-bool makePrivateDirectory(const std::string& path) {
-  if (mkdir(path.c_str(), 0700) != 0 && errno != EEXIST) return false;
-  const OwnedDescriptor directory = openFile(AT_FDCWD, path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-  struct stat status {};
-  if (!directory || fstat(directory.get(), &status) != 0 || status.st_uid != geteuid()) return false;
-  return (status.st_mode & 0777) == 0700 || fchmod(directory.get(), 0700) == 0;
-}
-
 }  // namespace
 
 std::vector<std::string> LinuxStandardDirectories::libraryDirectories() {
@@ -62,9 +55,7 @@ std::vector<std::string> LinuxStandardDirectories::cachesDirectories() {
 std::optional<std::string> LinuxStandardDirectories::temporaryDirectory() {
   const auto wanted = absoluteVariable("TMPDIR");
   if (wanted && isSafeForTemporaryFiles(*wanted)) return wanted;
-  if (!runtimeDirectory_) return std::nullopt;
-  std::string path = joinPath(*runtimeDirectory_, "tmp");
-  return makePrivateDirectory(path) ? std::optional(std::move(path)) : std::nullopt;
+  return runtimeDirectory_ ? makePrivateDirectory(joinPath(*runtimeDirectory_, "tmp")).path : std::nullopt;
 }
 
 std::string LinuxStandardDirectories::homeDirectory() {

@@ -4,24 +4,23 @@
 #include <cstdlib>
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <system_error>
 #include <unistd.h>
 
-#include "platform/linux/owned_descriptor.h"
+#include "platform/linux/files.h"
 
 namespace kel::platform {
 
 RuntimeDirectory resolveRuntimeDirectory() {
   const char* session = std::getenv("XDG_RUNTIME_DIR");
-  if (!session || session[0] != '/') return makeRuntimeDirectory("/tmp/kel-" + std::to_string(geteuid()));
-  return makeRuntimeDirectory(std::string(session) + "/kel");
+  if (!session || session[0] != '/') return makePrivateDirectory("/tmp/kel-" + std::to_string(geteuid()));
+  return makePrivateDirectory(std::string(session) + "/kel");
 }
 
-RuntimeDirectory makeRuntimeDirectory(const std::string& path) {
+RuntimeDirectory makePrivateDirectory(const std::string& path) {
   const auto refused = [&path](const std::string& reason) {
     return RuntimeDirectory{std::nullopt, path + ": " + reason};
   };
-  const auto failed = [&refused] { return refused(std::generic_category().message(errno)); };
+  const auto failed = [&refused] { return refused(errorText(errno)); };
 
   if (mkdir(path.c_str(), 0700) == 0) {
     // The file-creation mask may have taken permissions away from the owner.
@@ -29,7 +28,7 @@ RuntimeDirectory makeRuntimeDirectory(const std::string& path) {
   } else if (errno != EEXIST) {
     return failed();
   }
-  const OwnedDescriptor directory(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  const OwnedDescriptor directory = openFile(AT_FDCWD, path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
   struct stat status {};
   if (!directory || fstat(directory.get(), &status) != 0) return failed();
   if (status.st_uid != geteuid()) return refused("belongs to another user");

@@ -18,6 +18,6 @@ RuntimeDirectory resolveRuntimeDirectory();
 
 /// Makes `path` with mode 0700, unless it is there. Refused: anything but a directory (a symbolic link too),
 /// one that someone else owns, one that group or others may write to. Any thread.
-RuntimeDirectory makeRuntimeDirectory(const std::string& path);
+RuntimeDirectory makePrivateDirectory(const std::string& path);
 
 }  // namespace kel::platform

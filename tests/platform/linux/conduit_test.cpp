@@ -1,42 +1,194 @@
-#include <array>
 #include <fcntl.h>
-#include <fstream>
 #include <poll.h>
 #include <sys/resource.h>
-#include <sys/socket.h>
-#include <sys/un.h>
+#include <sys/time.h>
 #include <thread>
-#include <unistd.h>
 
-#include "conduit_fixture.h"
-#include "platform/linux/endpoint_socket.h"
-#include "platform/linux/linux_peer_process.h"
+#include "platform/linux/linux_conduit.h"
 #include "platform/property_list.h"
+#include "scratch.h"
+#include "support/manual_clock.h"
 
 namespace kel::platform {
 namespace {
 
 using namespace std::chrono_literals;
-using testing::Each;
 using testing::ElementsAre;
+using testing::EndsWith;
 using testing::HasSubstr;
 using testing::IsEmpty;
-using testing::SizeIs;
 
-/// The soft limit on descriptors, put back at the end.
-class DescriptorLimit {
+constexpr const char* endpointName = "com.orvex.kel.fetch_services";
+
+Bytes rawFrame(std::uint32_t length, std::uint32_t kind, std::uint64_t tag, BytesView payload) {
+  Bytes frame;
+  for (int shift = 24; shift >= 0; shift -= 8) frame.push_back(static_cast<std::uint8_t>(length >> shift));
+  for (int shift = 24; shift >= 0; shift -= 8) frame.push_back(static_cast<std::uint8_t>(kind >> shift));
+  for (int shift = 56; shift >= 0; shift -= 8) frame.push_back(static_cast<std::uint8_t>(tag >> shift));
+  frame.insert(frame.end(), payload.begin(), payload.end());
+  return frame;
+}
+
+Bytes requestFrame(std::uint64_t tag, const PropertyListValue& contents) {
+  const Bytes bytes = *writeBinaryPropertyList(contents).bytes;
+  return rawFrame(static_cast<std::uint32_t>(bytes.size()), 1, tag, bytes);
+}
+
+/// A peer that speaks bytes. Every wait has a generous limit, after which it counts as failed.
+class RawPeer {
  public:
-  explicit DescriptorLimit(rlim_t limit) {
-    getrlimit(RLIMIT_NOFILE, &before_);
-    const rlimit lowered{limit, before_.rlim_max};
-    EXPECT_EQ(setrlimit(RLIMIT_NOFILE, &lowered), 0);
+  explicit RawPeer(const std::string& path) : RawPeer(connectToEndpoint(path, 0)) {}
+  explicit RawPeer(OwnedDescriptor connected) : socket_(std::move(connected)) {
+    EXPECT_TRUE(socket_);
+    const timeval limit{30, 0};
+    setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
   }
-  ~DescriptorLimit() { setrlimit(RLIMIT_NOFILE, &before_); }
 
-  static rlim_t inUse() { return static_cast<rlim_t>(OwnedDescriptor(dup(0)).get()); }
+  int get() const { return socket_.get(); }
+
+  /// The server may close before everything is sent; what that means is for the test to check.
+  void send(BytesView bytes) { ::send(get(), bytes.data(), bytes.size(), MSG_NOSIGNAL); }
+  void request(std::uint64_t tag, const PropertyListValue& contents) { send(requestFrame(tag, contents)); }
+
+  /// Up to `count` bytes, fewer when the other end closed the connection first.
+  Bytes receive(std::size_t count) {
+    Bytes bytes(count);
+    const ssize_t got = count == 0 ? 0 : recv(get(), bytes.data(), count, MSG_WAITALL);
+    EXPECT_TRUE(got >= 0 || errno == ECONNRESET) << "nothing came for half a minute";
+    bytes.resize(got > 0 ? static_cast<std::size_t>(got) : 0);
+    return bytes;
+  }
+
+  bool isClosed() { return receive(1).empty(); }
+
+  /// The next reply's contents, checked to carry `tag`; absent for a dropped frame.
+  std::optional<PropertyListValue> reply(std::uint64_t tag) {
+    const Bytes header = receive(16);
+    if (header.size() < 16) return "closed by the server";
+    const std::size_t length = std::size_t{header[0]} << 24 | header[1] << 16 | header[2] << 8 | header[3];
+    EXPECT_EQ(header, rawFrame(static_cast<std::uint32_t>(length), length == 0 ? 3 : 2, tag, {}));
+    return length == 0 ? std::nullopt : readBinaryPropertyList(receive(length)).value;
+  }
 
  private:
-  rlimit before_{};
+  OwnedDescriptor socket_;
+};
+
+/// A server in a scratch directory that does what a request's string says: "hold" keeps the message, "drop"
+/// lets go of it, "big" answers with 10 MB, "elsewhere..." is echoed from another thread, anything else at
+/// once.
+class ConduitTest : public ScratchTest {
+ protected:
+  ~ConduitTest() override { stopServer(); }
+
+  LinuxConduit makeConduit(LauncherSockets passed = {}) {
+    LinuxConduit::Environment environment;
+    environment.runtimeDirectory = [this] { return makePrivateDirectory(scratch.path()); };
+    environment.launcherSockets = [passed] { return passed; };
+    return LinuxConduit(log, clock, std::move(environment));
+  }
+
+  /// Serves the endpoint, with the sockets that a launcher `passed`.
+  void startServer(LauncherSockets passed = {}) {
+    const auto handler = [this](const ConduitEvent& event) { handle(event); };
+    ConduitListening listening = makeConduit(std::move(passed)).listen(endpointName, queue, handler);
+    EXPECT_EQ(listening.error, "");
+    listener = std::move(listening.listener);
+  }
+  void stopServer() {
+    queue.sync([&] { listener.reset(); });
+  }
+
+  /// Waits until `count` requests have arrived in all and the server has taken whatever else it would take.
+  std::size_t awaitRequests(std::size_t count) {
+    std::unique_lock lock(mutex);
+    EXPECT_TRUE(changed.wait_for(lock, std::chrono::seconds(30), [&] { return requests >= count; }));
+    lock.unlock();
+    EXPECT_TRUE(isServing());
+    lock.lock();
+    return --requests;
+  }
+
+  /// True when a new client is served.
+  bool isServing() {
+    RawPeer client(socketPath);
+    client.request(7, "still there?");
+    return client.reply(7) == PropertyListValue("still there?");
+  }
+
+  const std::string socketPath = scratch / endpointName;
+  test::ManualClock clock;
+  const PropertyListValue big{Bytes(10'000'000, 'b')};
+
+  std::mutex mutex;
+  std::condition_variable changed;
+  std::size_t requests = 0;                           // under mutex
+  std::vector<std::shared_ptr<ConduitMessage>> held;  // under mutex
+  std::vector<std::string> errors;                    // under mutex
+
+  SerialQueue otherQueue{"other"}, queue{"KEL Conduit Server"};
+  std::unique_ptr<ConduitListener> listener;
+
+ private:
+  void handle(const ConduitEvent& event) {
+    queue.assertCurrent();
+    EXPECT_FALSE(std::exchange(handling, true)) << "an event inside the handling of another";
+    if (const auto* connection = std::get_if<std::shared_ptr<ConduitConnection>>(&event)) {
+      EXPECT_EQ((*connection)->peer()->processID(), getpid());
+      (*connection)->setEventHandler([this](const ConduitEvent& inner) { handle(inner); });
+      (*connection)->start();
+    } else if (const auto* error = std::get_if<ConduitError>(&event)) {
+      const std::lock_guard lock(mutex);
+      errors.push_back(error->description);
+    } else {
+      perform(std::get<std::shared_ptr<ConduitMessage>>(event));
+    }
+    handling = false;
+    changed.notify_all();
+  }
+
+  void perform(const std::shared_ptr<ConduitMessage>& message) {
+    const std::string* text = message->contents().asString();
+    const std::string what = text ? *text : "";
+    const std::lock_guard lock(mutex);
+    ++requests;
+    if (what == "hold") {
+      held.push_back(message);
+    } else if (what.starts_with("elsewhere")) {
+      otherQueue.async([message] { message->reply(message->contents()); });
+    } else if (what != "drop") {
+      message->reply(what == "big" ? big : message->contents());
+    }
+  }
+
+  bool handling = false;  // on queue
+};
+
+/// A connection of the conduit's own client.
+class Client {
+ public:
+  explicit Client(LinuxConduit conduit) : connection_(conduit.connect(endpointName, *queue_)) {
+    connection_->setEventHandler(
+        [this](const ConduitEvent& event) { events_.push_back(std::get<ConduitError>(event).description); });
+    connection_->start();
+  }
+
+  std::string send(const PropertyListValue& contents) {
+    const ConduitReply reply = connection_->sendAndWait(contents);
+    const auto* error = std::get_if<ConduitError>(&reply);
+    return error ? error->description : *std::get<PropertyListValue>(reply).asString();
+  }
+
+  /// What went to the event handler until the end of its queue.
+  std::vector<std::string> eventsInTheEnd() {
+    queue_.reset();
+    return events_;
+  }
+
+ private:
+  std::vector<std::string> events_;  // on the queue
+  std::unique_ptr<SerialQueue> queue_ = std::make_unique<SerialQueue>("kel contact queue");
+  std::shared_ptr<ConduitConnection> connection_;
 };
 
 TEST_F(ConduitTest, EveryClientGetsTheRepliesToItsOwnRequests) {
@@ -44,218 +196,259 @@ TEST_F(ConduitTest, EveryClientGetsTheRepliesToItsOwnRequests) {
   std::vector<std::thread> clients;
   for (int i = 0; i < 4; ++i) {
     clients.emplace_back([this, i] {
-      SerialQueue contact("kel contact queue");
-      const auto connection = conduit.connect(endpointName, contact);
-      connection->start();
+      Client client(makeConduit());
       for (int j = 0; j < 50; ++j) {
-        const PropertyListValue text((j % 2 == 0 ? "elsewhere " : "here ") + std::to_string(100 * i + j));
-        const ConduitReply reply = connection->sendAndWait(text);
-        ASSERT_TRUE(std::holds_alternative<PropertyListValue>(reply));
-        EXPECT_EQ(std::get<PropertyListValue>(reply), text);
+        const std::string text = (j % 2 == 0 ? "elsewhere " : "here ") + std::to_string(100 * i + j);
+        EXPECT_EQ(client.send(text), text);
       }
     });
   }
   for (auto& client : clients) client.join();
-  EXPECT_THAT(peers, testing::AllOf(SizeIs(4), Each(getpid())));
 }
 
-TEST_F(ConduitTest, AMalformedMessageEndsItsConnectionWithOneLineAndNoOther) {
+TEST_F(ConduitTest, AMalformedMessageEndsItsConnectionWithOneLineAndASilentOrHalfSentOneHoldsUpNobody) {
   startServer();
-  RawClient bystander(socketPath());
-  const std::string good = "bplist00";
-  const struct {
-    const char* name;
-    Bytes bytes;
-    const char* complaint;
-  } rows[] = {
-      {"text", Bytes(16, 'x'), "unexpected frame kind"},
-      {"kind 0", rawFrame(1, 0, 1, "x"), "unexpected frame kind 0"},
-      {"a reply", rawFrame(1, 2, 1, "x"), "unexpected frame kind 2"},
-      {"a dropped frame", rawFrame(0, 3, 1, ""), "unexpected frame kind 3"},
-      {"no payload", rawFrame(0, 1, 1, ""), "frame length 0"},
-      {"a byte too many", rawFrame((1U << 20) + 1, 1, 1, ""), "frame length 1048577"},
-      {"a giant", rawFrame(0xFFFFFFFF, 1, 1, ""), "frame length 4294967295"},
-      {"garbage in a frame", rawFrame(8, 1, 1, good), "malformed message"},
-      {"garbage after a request", rawFrame(8, 1, 0, "bplist99"), "malformed message"},
+  const RawPeer silent(socketPath);
+  RawPeer bystander(socketPath);
+  const Bytes request = requestFrame(3, Bytes(300'000, 'r'));
+  bystander.send(BytesView(request).first(15));
+  const Bytes garbage(8, 'g');
+  const std::pair<Bytes, const char*> rows[] = {
+      {Bytes(16, 'x'), "unexpected frame kind"},
+      {rawFrame(8, 2, 1, garbage), "unexpected frame kind 2"},
+      {rawFrame(0, 1, 1, {}), "frame length 0"},
+      {rawFrame((1U << 20) + 1, 1, 1, {}), "frame length 1048577"},
+      {rawFrame(0xFFFFFFFF, 1, 1, {}), "frame length 4294967295"},
+      {rawFrame(8, 1, 1, garbage), "malformed message"},
   };
   std::size_t lines = 0;
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
-    RawClient client(socketPath());
-    client.send(row.bytes);
-    EXPECT_TRUE(client.isClosedByServer());
+  for (const auto& [bytes, complaint] : rows) {
+    SCOPED_TRACE(complaint);
+    RawPeer client(socketPath);
+    client.send(bytes);
+    EXPECT_TRUE(client.isClosed());
     queue.sync([] {});
+    ASSERT_EQ(log.messages().size(), ++lines);
+    EXPECT_THAT(log.messages().back(), HasSubstr(complaint));
     const std::lock_guard lock(mutex);
-    ASSERT_THAT(log.lines(), SizeIs(++lines));
-    EXPECT_THAT(log.lines().back(), HasSubstr(row.complaint));
-    EXPECT_THAT(errors, testing::AllOf(SizeIs(lines), Each("Connection invalid")));
+    EXPECT_EQ(errors, std::vector<std::string>(lines, "Connection invalid"));
   }
-  bystander.sendRequest(3, "well-behaved");
-  EXPECT_EQ(bystander.receiveReply(3), PropertyListValue("well-behaved"));
-}
-
-TEST_F(ConduitTest, ARequestIsReadHoweverItIsCutAndASilentOrHalfSentOneHoldsUpNobody) {
-  startServer();
-  RawClient silent(socketPath()), slow(socketPath());
-  const Bytes request = requestFrame(9, Bytes(300'000, 'r'));
-  for (const auto& [begin, end] :
-       {std::pair<std::size_t, std::size_t>{0, 1}, {1, 15}, {15, 17}, {17, 250'000}}) {
-    slow.send(BytesView(request).subspan(begin, end - begin));
-    EXPECT_TRUE(isServing());
-  }
-  slow.send(BytesView(request).subspan(250'000));
-  EXPECT_EQ(slow.receiveReply(9), PropertyListValue(Bytes(300'000, 'r')));
+  bystander.send(BytesView(request).subspan(15));
+  EXPECT_TRUE(bystander.reply(3) == PropertyListValue(Bytes(300'000, 'r')));
 }
 
 TEST_F(ConduitTest, AMessageThatStaysHalfSentForTenSecondsEndsItsConnection) {
   startServer();
-  RawClient client(socketPath());
+  RawPeer client(socketPath);
   const Bytes request = requestFrame(1, "never finished");
   client.send(BytesView(request).first(5));
   ASSERT_TRUE(clock.awaitTimers(1));
   client.send(BytesView(request).subspan(5, 5));
   clock.advance(10s);
   ASSERT_TRUE(clock.awaitTimers(1)) << "closed though more had come";
-  EXPECT_THAT(log.lines(), IsEmpty());
+  EXPECT_THAT(log.messages(), IsEmpty());
   clock.advance(10s);
-  EXPECT_TRUE(client.isClosedByServer());
-  EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("half sent")));
-}
-
-TEST_F(ConduitTest, RequestsThatArriveTogetherAreAnsweredOneAfterTheOther) {
-  startServer();
-  RawClient client(socketPath());
-  Bytes together;
-  for (std::uint64_t tag = 1; tag <= 20; ++tag) {
-    const Bytes frame = requestFrame(tag, static_cast<int>(tag));
-    together.insert(together.end(), frame.begin(), frame.end());
-  }
-  client.send(together);
-  for (std::uint64_t tag = 1; tag <= 20; ++tag) {
-    EXPECT_EQ(client.receiveReply(tag), PropertyListValue(static_cast<int>(tag)));
-  }
+  EXPECT_TRUE(client.isClosed());
+  EXPECT_THAT(log.messages(), ElementsAre(HasSubstr("half sent")));
 }
 
 TEST_F(ConduitTest, DescriptorsThatSomebodySendsAreClosedAtOnce) {
   startServer();
-  RawClient client(socketPath());
-  std::array<int, 2> ends{};
-  ASSERT_EQ(pipe2(ends.data(), O_CLOEXEC), 0);
+  RawPeer client(socketPath);
+  int ends[2];
+  ASSERT_EQ(pipe2(ends, O_CLOEXEC), 0);
   const OwnedDescriptor readEnd(ends[0]);
   OwnedDescriptor writeEnd(ends[1]);
-  client.sendWithDescriptor(requestFrame(1, "take this"), writeEnd.get());
-  EXPECT_EQ(client.receiveReply(1), PropertyListValue("take this"));
+  Bytes bytes = requestFrame(1, "take this");
+  iovec part{bytes.data(), bytes.size()};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+  const msghdr message{nullptr, 0, &part, 1, control, sizeof control, 0};
+  *CMSG_FIRSTHDR(&message) = {CMSG_LEN(sizeof(int)), SOL_SOCKET, SCM_RIGHTS};
+  *reinterpret_cast<int*>(CMSG_DATA(CMSG_FIRSTHDR(&message))) = writeEnd.get();
+  ASSERT_EQ(sendmsg(client.get(), &message, 0), static_cast<ssize_t>(bytes.size()));
+  EXPECT_EQ(client.reply(1), PropertyListValue("take this"));
   writeEnd.reset();
   pollfd pipe{readEnd.get(), POLLIN, 0};
   EXPECT_EQ(poll(&pipe, 1, 0), 1) << "the server still has the descriptor";
 }
 
-TEST_F(ConduitTest, AReaderThatTakesNothingHoldsUpNobodyAndGetsItsAnswersInTheEnd) {
+TEST_F(ConduitTest, OnlyAReaderThatTakesNothingForAMinuteIsDisconnectedAndNoneHoldsUpOthers) {
   startServer();
-  RawClient slow(socketPath());
-  for (std::uint64_t tag = 1; tag <= 3; ++tag) slow.sendRequest(tag, "big");
+  RawPeer slow(socketPath), deaf(socketPath);
+  for (std::uint64_t tag = 1; tag <= 3; ++tag) slow.request(tag, "big");
   EXPECT_EQ(awaitRequests(1), 1U) << "the server piles up answers that nobody takes";
-  for (std::uint64_t tag = 1; tag <= 3; ++tag) {
-    const auto reply = slow.receiveReply(tag);
-    EXPECT_TRUE(reply == big);
-  }
-}
-
-TEST_F(ConduitTest, AReaderThatTakesNothingForAMinuteIsDisconnected) {
-  startServer();
-  RawClient slow(socketPath());
-  slow.sendRequest(1, "big");
+  deaf.request(1, "big");
   for (int i = 0; i < 6; ++i) {
-    ASSERT_TRUE(clock.awaitTimers(1));
-    EXPECT_THAT(log.lines(), IsEmpty());
+    ASSERT_TRUE(clock.awaitTimers(2));
+    EXPECT_THAT(log.messages(), IsEmpty());
+    const bool isGood = i != 4 || slow.reply(1) == big;
+    EXPECT_TRUE(isGood);
     clock.advance(10s);
   }
   queue.sync([] {});  // before what is drained below counts as taken
-  EXPECT_TRUE(slow.isClosedByServer());
-  EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("not taken")));
+  EXPECT_LT(deaf.receive(10'000'000).size(), 10'000'000U);
+  EXPECT_THAT(log.messages(), ElementsAre(HasSubstr("not taken")));
+  for (std::uint64_t tag = 2; tag <= 3; ++tag) EXPECT_TRUE(slow.reply(tag) == big);
 }
 
-TEST_F(ConduitTest, NoMoreThanEightRequestsOfAClientAreInFlight) {
+TEST_F(ConduitTest, NoMoreThanEightRequestsOfAClientAreInFlightAndEachIsAnsweredAtMostOnce) {
   startServer();
-  RawClient client(socketPath());
-  for (std::uint64_t tag = 1; tag <= 10; ++tag) client.sendRequest(tag, "hold");
+  std::optional<RawPeer> client(socketPath);
+  for (std::uint64_t tag = 0; tag <= 9; ++tag) client->request(tag, "hold");
   EXPECT_EQ(awaitRequests(8), 8U);
   {
     const std::lock_guard lock(mutex);
-    held[0]->reply("done");
-    held[0]->reply("a second reply");
-    held[1].reset();
+    EXPECT_FALSE(held[0]->canReply());
+    held[0]->reply("nobody asked");
+    held[1]->reply("done");
+    held[1]->reply("a second reply");
+    held[2].reset();
   }
-  EXPECT_EQ(client.receiveReply(1), PropertyListValue("done"));
-  EXPECT_EQ(client.receiveReply(2), std::nullopt);
+  EXPECT_EQ(client->reply(1), PropertyListValue("done"));
+  EXPECT_EQ(client->reply(2), std::nullopt);
   EXPECT_EQ(awaitRequests(10), 10U);
-}
-
-TEST_F(ConduitTest, ARequestWithoutATagIsPerformedAndNotAnswered) {
-  startServer();
-  RawClient client(socketPath());
-  client.sendRequest(0, "hold");
-  client.sendRequest(0, "drop");
-  client.sendRequest(5, "next");
-  EXPECT_EQ(client.receiveReply(5), PropertyListValue("next"));
-  const std::lock_guard lock(mutex);
-  ASSERT_THAT(held, SizeIs(1));
-  EXPECT_FALSE(held[0]->canReply());
-}
-
-TEST_F(ConduitTest, AnAnswerToAClientThatHasGoneIsForgotten) {
-  startServer();
-  std::optional<RawClient> client(socketPath());
-  client->sendRequest(1, "hold");
-  awaitRequests(1);
   client.reset();
   EXPECT_TRUE(isServing());
   const std::lock_guard lock(mutex);
-  EXPECT_THAT(errors, testing::Contains("Connection invalid"));
-  held[0]->reply("too late");
+  EXPECT_EQ(errors[0], "Connection invalid");
+  held[3]->reply("too late");
 }
 
 TEST_F(ConduitTest, WithoutDescriptorsAConnectionIsGivenUpAndTheServerGoesOn) {
   startServer();
   OwnedDescriptor doomed(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
   queue.sync([] {});
-  {
-    const DescriptorLimit limit(DescriptorLimit::inUse());
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    socketPath().copy(address.sun_path, sizeof address.sun_path - 1);
-    ASSERT_EQ(connect(doomed.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-    EXPECT_TRUE(RawClient(std::move(doomed)).isClosedByServer());
-  }
+  rlimit before{};
+  getrlimit(RLIMIT_NOFILE, &before);
+  const rlimit used{static_cast<rlim_t>(OwnedDescriptor(dup(0)).get()), before.rlim_max};
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &used), 0);
+  const auto address = unixAddress(socketPath);
+  EXPECT_EQ(connect(doomed.get(), address->get(), address->length), 0);
+  EXPECT_TRUE(RawPeer(std::move(doomed)).isClosed());
+  setrlimit(RLIMIT_NOFILE, &before);
   EXPECT_TRUE(isServing());
-  EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("out of descriptors")));
+  EXPECT_THAT(log.messages(), ElementsAre(HasSubstr("out of descriptors")));
 }
 
-TEST_F(ConduitTest, WhereIdleConnectionsPileUpTheOldestGivesWay) {
-  {
-    const DescriptorLimit limit(64);
-    startServer();
-  }
-  RawClient busy(socketPath());
-  busy.sendRequest(1, "hold");
-  awaitRequests(1);
-  std::vector<std::unique_ptr<RawClient>> idle;
-  for (int i = 0; i < 17; ++i) idle.push_back(std::make_unique<RawClient>(socketPath()));
-  EXPECT_TRUE(idle.front()->isClosedByServer());
-  EXPECT_TRUE(isServing());
-  const std::lock_guard lock(mutex);
-  held[0]->reply("kept");
-  EXPECT_EQ(busy.receiveReply(1), PropertyListValue("kept"));
-}
-
-TEST_F(ConduitTest, ThePeerIsHeldByADescriptorOfItsProcess) {
+TEST_F(ConduitTest, ADroppedOrTooLargeRequestCostsOnlyItselfAndAServerThatGoesInterruptsIt) {
   startServer();
-  const OwnedDescriptor connected = connectToEndpoint(socketPath(), 0);
-  const auto peer = LinuxPeerProcess::ofSocket(connected.get(), getpid());
-  const std::string info = "/proc/self/fdinfo/" + std::to_string(peer->descriptor());
-  std::ifstream file(info);
-  const std::string text{std::istreambuf_iterator<char>(file), {}};
-  EXPECT_THAT(text, HasSubstr("Pid:\t" + std::to_string(getpid()) + "\n"));
+  Client client(makeConduit());
+  EXPECT_EQ(client.send("drop"), "Connection interrupted");
+  EXPECT_EQ(client.send(Bytes(1U << 20, 'r')), "The request is too large");
+  EXPECT_EQ(client.send("next"), "next");
+  std::string reply;
+  std::thread sender([&] { reply = client.send("hold"); });
+  awaitRequests(3);
+  stopServer();
+  sender.join();
+  EXPECT_EQ(reply, "Connection interrupted");
+  EXPECT_EQ(client.send("gone"), "Connection invalid");
+  EXPECT_THAT(client.eventsInTheEnd(), ElementsAre("Connection interrupted")) << "only the first";
+}
+
+TEST_F(ConduitTest, AServerThatSpeaksNonsenseInterruptsTheRequest) {
+  const Bytes payload = *writeBinaryPropertyList("good").bytes;
+  const auto length = static_cast<std::uint32_t>(payload.size());
+  const Bytes rows[] = {
+      {},                                                   // nothing
+      rawFrame(length, 2, 1, BytesView(payload).first(9)),  // half a reply
+      rawFrame(length, 2, 2, payload),                      // a reply to something else
+      rawFrame(length, 1, 1, payload),                      // a request
+      rawFrame(4, 2, 1, Bytes(4, 'g')),                     // garbage in a reply
+      rawFrame((1U << 30) + 1, 2, 1, {}),                   // a reply of more than 1 GiB
+      rawFrame(length, 3, 1, payload),                      // a dropped frame with a payload
+  };
+  const EndpointBinding binding = bindEndpoint(socketPath);
+  for (const Bytes& answer : rows) {
+    Client client(makeConduit());
+    std::thread answerer([&] {
+      RawPeer peer(OwnedDescriptor(accept4(binding.socket->get(), nullptr, nullptr, 0)));
+      peer.receive(requestFrame(1, "hello").size());
+      peer.send(answer);
+    });
+    EXPECT_EQ(client.send("hello"), "Connection interrupted") << &answer - rows;
+    answerer.join();
+  }
+}
+
+TEST_F(ConduitTest, ALiveServerKeepsTheEndpointAndADeadOneLosesIt) {
+  const auto outcome = [this] {
+    const EndpointBinding second = bindEndpoint(socketPath);
+    EXPECT_EQ(second.servedElsewhere, second.error == socketPath + ": another server holds the endpoint");
+    return second.servedElsewhere ? "served elsewhere" : second.error.empty() ? "bound" : "error";
+  };
+  startServer();
+  EXPECT_EQ(scratch.mode(endpointName), 0600U);
+  EXPECT_EQ(outcome(), "served elsewhere");
+  ASSERT_EQ(unlink((socketPath + ".lock").c_str()), 0);
+  EXPECT_EQ(outcome(), "served elsewhere") << "whoever removes the lock file does not free the endpoint";
+  EXPECT_TRUE(isServing());
+  stopServer();
+  EXPECT_FALSE(files.exists(socketPath));
+
+  {
+    const EndpointBinding dying = bindEndpoint(scratch / "other");
+    ASSERT_EQ(link((scratch / "other").c_str(), socketPath.c_str()), 0);
+    EXPECT_EQ(outcome(), "served elsewhere");
+  }
+  EXPECT_TRUE(files.exists(socketPath));
+  EXPECT_EQ(outcome(), "bound");
+
+  scratch.write(endpointName, "no socket");
+  EXPECT_EQ(outcome(), "error");
+  EXPECT_EQ(scratch.read(endpointName), "no socket");
+  EXPECT_THAT(bindEndpoint(scratch / std::string(150, 'n')).error, EndsWith("File name too long"));
+}
+
+TEST_F(ConduitTest, OfTheLaunchersSocketsTheOneThatListensAndBearsTheNameIsUsed) {
+  EndpointBinding other = bindEndpoint(scratch / "other"), ours = bindEndpoint(socketPath);
+  const OwnedDescriptor inet(socket(AF_INET, SOCK_STREAM, 0)), datagram(socket(AF_UNIX, SOCK_DGRAM, 0)),
+      idle(socket(AF_UNIX, SOCK_STREAM, 0));
+  constexpr int first = 200;  // consecutive numbers, as a launcher passes them
+  int next = first;
+  for (const int each : {inet.get(), datagram.get(), idle.get(), other.socket->get(), ours.socket->get()}) {
+    ASSERT_EQ(dup2(each, next), next);
+    ++next;
+  }
+  const std::string name = endpointName;
+  startServer({first, 5, name + ":" + name + ":" + name + ":other:" + name});
+  EXPECT_TRUE(isServing());
+  EXPECT_EQ(fcntl(first, F_GETFD), FD_CLOEXEC);
+  stopServer();
+  EXPECT_EQ(fcntl(first + 4, F_GETFD), -1) << "another socket than the fifth was taken";
+  EXPECT_TRUE(files.exists(socketPath)) << "the launcher's socket file was removed";
+  for (int each = first; each < first + 4; ++each) close(each);
+}
+
+TEST(LauncherSocketsTest, OnlyWhatIsMeantForThisProcessIsTakenAndTheVariablesAreRemoved) {
+  const std::string self = std::to_string(getpid());
+  for (const std::string& row : {self + " 2", std::string("1 2"), self + " ", self + " -1", self + " 2x",
+                                 self + " 100000", self + " 99999999999", std::string(" 2")}) {
+    setenv("LISTEN_PID", row.substr(0, row.find(' ')).c_str(), 1);
+    setenv("LISTEN_FDS", row.substr(row.find(' ') + 1).c_str(), 1);
+    EXPECT_EQ(takeLauncherSockets().count, row == self + " 2" ? 2 : 0) << row;
+    EXPECT_FALSE(getenv("LISTEN_PID") || getenv("LISTEN_FDS"));
+  }
+}
+
+TEST_F(ScratchTest, APrivateDirectoryIsOneThatNobodyElseCanWriteTo) {
+  const std::string path = scratch / "kel";
+  const mode_t before = umask(0777);
+  EXPECT_EQ(makePrivateDirectory(path).path, path);
+  umask(before);
+  EXPECT_EQ(scratch.mode("kel"), 0700U);
+  chmod(path.c_str(), 0755);
+  EXPECT_EQ(makePrivateDirectory(path).path, path);
+  EXPECT_EQ(scratch.mode("kel"), 0700U);
+  ASSERT_EQ(symlink(path.c_str(), (scratch / "link").c_str()), 0);
+  for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"}) {
+    EXPECT_EQ(makePrivateDirectory(wrong).path, std::nullopt) << wrong;
+  }
+  chmod(path.c_str(), 0720);
+  EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("kel: others may write to it"));
+  if (geteuid() == 0 && chown(path.c_str(), 12345, 12345) == 0) {
+    EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("belongs to another user"));
+  }
 }
 
 }  // namespace

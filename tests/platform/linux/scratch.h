@@ -2,21 +2,19 @@
 
 #include <filesystem>
 #include <fstream>
-#include <iterator>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
 #include <set>
-#include <stdexcept>
-#include <stdlib.h>
-#include <string>
-#include <sys/stat.h>
-#include <vector>
+#include <sys/socket.h>
+#include <unistd.h>
 
-#include "platform/bytes.h"
-#include "platform/guarded.h"
-#include "platform/system_log.h"
+#include "platform/linux/files.h"
+#include "platform/linux/linux_file_system.h"
+#include "platform/linux/unix_address.h"
+#include "support/print.h"
+#include "support/recording_log.h"
 
 namespace kel::platform {
-
-inline Bytes bytesOf(std::string_view text) { return Bytes(text.begin(), text.end()); }
 
 /// A directory that is removed, with all in it, at the end of the test.
 class Scratch {
@@ -33,17 +31,17 @@ class Scratch {
   const std::string& path() const { return path_; }
   std::string operator/(std::string_view name) const { return path_ + "/" + std::string(name); }
 
+  std::string makeDirectory(std::string_view name) const {
+    std::filesystem::create_directories(*this / name);
+    return *this / name;
+  }
+
   /// Makes the file and its parent directories; returns its path.
-  std::string write(std::string_view name, std::string_view text) const {
+  std::string write(std::string_view name, std::string_view text = "") const {
     const std::string file = *this / name;
     std::filesystem::create_directories(std::filesystem::path(file).parent_path());
     std::ofstream(file, std::ios::binary) << text;
     return file;
-  }
-
-  std::string makeDirectory(std::string_view name) const {
-    std::filesystem::create_directories(*this / name);
-    return *this / name;
   }
 
   std::string read(std::string_view name) const {
@@ -69,16 +67,11 @@ class Scratch {
   std::string path_;
 };
 
-/// Keeps what is logged. Any thread.
-class CollectedLog final : public SystemLog {
- public:
-  void write(std::string_view message) override {
-    lines_.with([message](auto& lines) { lines.emplace_back(message); });
-  }
-  std::vector<std::string> lines() const { return lines_.copy(); }
-
- private:
-  Guarded<std::vector<std::string>> lines_;
+class ScratchTest : public testing::Test {
+ protected:
+  Scratch scratch;
+  test::RecordingLog log;
+  LinuxFileSystem files{log};
 };
 
 }  // namespace kel::platform
