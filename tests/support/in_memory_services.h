@@ -50,6 +50,8 @@ class RecordingLog : public platform::SystemLog {
     return messages_.with([](auto& messages) { return std::exchange(messages, {}); });
   }
 
+  std::vector<std::string> messages() const { return messages_.copy(); }
+
  private:
   platform::Guarded<std::vector<std::string>> messages_;
 };

@@ -56,10 +56,14 @@ std::optional<NotificationRecord> readRecord(int directory, const std::string& f
 
 /// Holders keep the lock for microseconds; one that does not let go must not stop the caller.
 bool lockInTime(int lock) {
-  constexpr int attempts = 100;
-  for (int attempt = 0; flock(lock, LOCK_EX | LOCK_NB) != 0; ++attempt) {
-    if ((errno != EWOULDBLOCK && errno != EINTR) || attempt == attempts) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(250);
+  while (flock(lock, LOCK_EX | LOCK_NB) != 0) {
+    const int error = errno;
+    if ((error != EWOULDBLOCK && error != EINTR) || std::chrono::steady_clock::now() > deadline) {
+      errno = error;
+      return false;
+    }
+    std::this_thread::sleep_for(std::chrono::microseconds(100));
   }
   return true;
 }
