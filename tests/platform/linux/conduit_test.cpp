@@ -22,9 +22,9 @@ constexpr const char* endpointName = "com.orvex.kel.fetch_services";
 
 Bytes rawFrame(std::uint32_t length, std::uint32_t kind, std::uint64_t tag, BytesView payload) {
   Bytes frame;
-  for (int shift = 24; shift >= 0; shift -= 8) frame.push_back(static_cast<std::uint8_t>(length >> shift));
-  for (int shift = 24; shift >= 0; shift -= 8) frame.push_back(static_cast<std::uint8_t>(kind >> shift));
-  for (int shift = 56; shift >= 0; shift -= 8) frame.push_back(static_cast<std::uint8_t>(tag >> shift));
+  for (const std::uint64_t number : {std::uint64_t{length} << 32 | kind, tag}) {
+    for (int shift = 56; shift >= 0; shift -= 8) frame.push_back(static_cast<std::uint8_t>(number >> shift));
+  }
   frame.insert(frame.end(), payload.begin(), payload.end());
   return frame;
 }
@@ -74,9 +74,8 @@ class RawPeer {
   OwnedDescriptor socket_;
 };
 
-/// A server in a scratch directory that does what a request's string says: "hold" keeps the message, "drop"
-/// lets go of it, "big" answers with 10 MB, "elsewhere..." is echoed from another thread, anything else at
-/// once.
+/// A server that does what a request's string says: "hold" keeps the message, "drop" lets go of it, "big"
+/// answers with 10 MB, "elsewhere..." is echoed from another thread, anything else at once.
 class ConduitTest : public ScratchTest {
  protected:
   ~ConduitTest() override { stopServer(); }
@@ -99,7 +98,7 @@ class ConduitTest : public ScratchTest {
     queue.sync([&] { listener.reset(); });
   }
 
-  /// Waits until `count` requests have arrived in all and the server has taken whatever else it would take.
+  /// Waits until `count` requests have arrived and the server has taken whatever else it would take.
   std::size_t awaitRequests(std::size_t count) {
     std::unique_lock lock(mutex);
     EXPECT_TRUE(changed.wait_for(lock, std::chrono::seconds(30), [&] { return requests >= count; }));
@@ -132,7 +131,6 @@ class ConduitTest : public ScratchTest {
  private:
   void handle(const ConduitEvent& event) {
     queue.assertCurrent();
-    EXPECT_FALSE(std::exchange(handling, true)) << "an event inside the handling of another";
     if (const auto* connection = std::get_if<std::shared_ptr<ConduitConnection>>(&event)) {
       EXPECT_EQ((*connection)->peer()->processID(), getpid());
       (*connection)->setEventHandler([this](const ConduitEvent& inner) { handle(inner); });
@@ -143,7 +141,6 @@ class ConduitTest : public ScratchTest {
     } else {
       perform(std::get<std::shared_ptr<ConduitMessage>>(event));
     }
-    handling = false;
     changed.notify_all();
   }
 
@@ -160,16 +157,12 @@ class ConduitTest : public ScratchTest {
       message->reply(what == "big" ? big : message->contents());
     }
   }
-
-  bool handling = false;  // on queue
 };
 
-/// A connection of the conduit's own client.
+/// The conduit's own client.
 class Client {
  public:
-  explicit Client(LinuxConduit conduit) : connection_(conduit.connect(endpointName, *queue_)) {
-    connection_->setEventHandler(
-        [this](const ConduitEvent& event) { events_.push_back(std::get<ConduitError>(event).description); });
+  explicit Client(LinuxConduit conduit) : connection_(conduit.connect(endpointName, queue_)) {
     connection_->start();
   }
 
@@ -179,15 +172,8 @@ class Client {
     return error ? error->description : *std::get<PropertyListValue>(reply).asString();
   }
 
-  /// What went to the event handler until the end of its queue.
-  std::vector<std::string> eventsInTheEnd() {
-    queue_.reset();
-    return events_;
-  }
-
  private:
-  std::vector<std::string> events_;  // on the queue
-  std::unique_ptr<SerialQueue> queue_ = std::make_unique<SerialQueue>("kel contact queue");
+  SerialQueue queue_{"kel contact queue"};
   std::shared_ptr<ConduitConnection> connection_;
 };
 
@@ -214,7 +200,6 @@ TEST_F(ConduitTest, AMalformedMessageEndsItsConnectionWithOneLineAndASilentOrHal
   bystander.send(BytesView(request).first(15));
   const Bytes garbage(8, 'g');
   const std::pair<Bytes, const char*> rows[] = {
-      {Bytes(16, 'x'), "unexpected frame kind"},
       {rawFrame(8, 2, 1, garbage), "unexpected frame kind 2"},
       {rawFrame(0, 1, 1, {}), "frame length 0"},
       {rawFrame((1U << 20) + 1, 1, 1, {}), "frame length 1048577"},
@@ -281,8 +266,7 @@ TEST_F(ConduitTest, OnlyAReaderThatTakesNothingForAMinuteIsDisconnectedAndNoneHo
   for (int i = 0; i < 6; ++i) {
     ASSERT_TRUE(clock.awaitTimers(2));
     EXPECT_THAT(log.messages(), IsEmpty());
-    const bool isGood = i != 4 || slow.reply(1) == big;
-    EXPECT_TRUE(isGood);
+    EXPECT_TRUE(i != 4 || slow.reply(1) == big);
     clock.advance(10s);
   }
   queue.sync([] {});  // before what is drained below counts as taken
@@ -343,7 +327,6 @@ TEST_F(ConduitTest, ADroppedOrTooLargeRequestCostsOnlyItselfAndAServerThatGoesIn
   sender.join();
   EXPECT_EQ(reply, "Connection interrupted");
   EXPECT_EQ(client.send("gone"), "Connection invalid");
-  EXPECT_THAT(client.eventsInTheEnd(), ElementsAre("Connection interrupted")) << "only the first";
 }
 
 TEST_F(ConduitTest, AServerThatSpeaksNonsenseInterruptsTheRequest) {
@@ -353,7 +336,6 @@ TEST_F(ConduitTest, AServerThatSpeaksNonsenseInterruptsTheRequest) {
       {},                                                   // nothing
       rawFrame(length, 2, 1, BytesView(payload).first(9)),  // half a reply
       rawFrame(length, 2, 2, payload),                      // a reply to something else
-      rawFrame(length, 1, 1, payload),                      // a request
       rawFrame(4, 2, 1, Bytes(4, 'g')),                     // garbage in a reply
       rawFrame((1U << 30) + 1, 2, 1, {}),                   // a reply of more than 1 GiB
       rawFrame(length, 3, 1, payload),                      // a dropped frame with a payload
@@ -385,13 +367,11 @@ TEST_F(ConduitTest, ALiveServerKeepsTheEndpointAndADeadOneLosesIt) {
   EXPECT_TRUE(isServing());
   stopServer();
   EXPECT_FALSE(files.exists(socketPath));
-
   {
     const EndpointBinding dying = bindEndpoint(scratch / "other");
     ASSERT_EQ(link((scratch / "other").c_str(), socketPath.c_str()), 0);
     EXPECT_EQ(outcome(), "served elsewhere");
   }
-  EXPECT_TRUE(files.exists(socketPath));
   EXPECT_EQ(outcome(), "bound");
 
   scratch.write(endpointName, "no socket");
@@ -402,22 +382,21 @@ TEST_F(ConduitTest, ALiveServerKeepsTheEndpointAndADeadOneLosesIt) {
 
 TEST_F(ConduitTest, OfTheLaunchersSocketsTheOneThatListensAndBearsTheNameIsUsed) {
   EndpointBinding other = bindEndpoint(scratch / "other"), ours = bindEndpoint(socketPath);
-  const OwnedDescriptor inet(socket(AF_INET, SOCK_STREAM, 0)), datagram(socket(AF_UNIX, SOCK_DGRAM, 0)),
-      idle(socket(AF_UNIX, SOCK_STREAM, 0));
+  const OwnedDescriptor inet(socket(AF_INET, SOCK_STREAM, 0)), idle(socket(AF_UNIX, SOCK_STREAM, 0));
   constexpr int first = 200;  // consecutive numbers, as a launcher passes them
   int next = first;
-  for (const int each : {inet.get(), datagram.get(), idle.get(), other.socket->get(), ours.socket->get()}) {
+  for (const int each : {inet.get(), idle.get(), other.socket->get(), ours.socket->get()}) {
     ASSERT_EQ(dup2(each, next), next);
     ++next;
   }
   const std::string name = endpointName;
-  startServer({first, 5, name + ":" + name + ":" + name + ":other:" + name});
+  startServer({first, 4, name + ":" + name + ":other:" + name});
   EXPECT_TRUE(isServing());
   EXPECT_EQ(fcntl(first, F_GETFD), FD_CLOEXEC);
   stopServer();
-  EXPECT_EQ(fcntl(first + 4, F_GETFD), -1) << "another socket than the fifth was taken";
+  EXPECT_EQ(fcntl(first + 3, F_GETFD), -1) << "another socket than the fourth was taken";
   EXPECT_TRUE(files.exists(socketPath)) << "the launcher's socket file was removed";
-  for (int each = first; each < first + 4; ++each) close(each);
+  for (int each = first; each < first + 3; ++each) close(each);
 }
 
 TEST(LauncherSocketsTest, OnlyWhatIsMeantForThisProcessIsTakenAndTheVariablesAreRemoved) {
@@ -434,11 +413,8 @@ TEST(LauncherSocketsTest, OnlyWhatIsMeantForThisProcessIsTakenAndTheVariablesAre
 TEST_F(ScratchTest, APrivateDirectoryIsOneThatNobodyElseCanWriteTo) {
   const std::string path = scratch / "kel";
   const mode_t before = umask(0777);
-  EXPECT_EQ(makePrivateDirectory(path).path, path);
+  EXPECT_EQ(makePrivateDirectory(path).error, "");
   umask(before);
-  EXPECT_EQ(scratch.mode("kel"), 0700U);
-  chmod(path.c_str(), 0755);
-  EXPECT_EQ(makePrivateDirectory(path).path, path);
   EXPECT_EQ(scratch.mode("kel"), 0700U);
   ASSERT_EQ(symlink(path.c_str(), (scratch / "link").c_str()), 0);
   for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"}) {

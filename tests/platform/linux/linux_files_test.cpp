@@ -5,8 +5,6 @@
 #include "platform/linux/linux_application_registry.h"
 #include "platform/linux/linux_bundles.h"
 #include "platform/linux/linux_notification_seeds.h"
-#include "platform/linux/linux_preferences.h"
-#include "platform/linux/linux_services_publication.h"
 #include "scratch.h"
 
 namespace kel::platform {
@@ -16,32 +14,19 @@ using namespace std::string_literals;
 using namespace std::chrono_literals;
 using testing::ElementsAre;
 using testing::IsEmpty;
-using testing::SizeIs;
 using testing::StartsWith;
-using testing::UnorderedElementsAre;
-
-TEST_F(ScratchTest, ListingHoldsHiddenNamesAndLeavesOutThoseThatAreNotUTF8) {
-  for (const char* name : {".hidden", "caf\xc3\xa9", "latin\xe9", "latin\xe8"}) scratch.write(name);
-  EXPECT_THAT(files.listDirectory(scratch.path()).value(), UnorderedElementsAre(".hidden", "caf\xc3\xa9"));
-  EXPECT_THAT(log.messages(), ElementsAre(scratch.path() + ": left out 2 name(s) that are not UTF-8"));
-}
 
 TEST_F(ScratchTest, ReadGivesRegularFilesUpToTheLimit) {
   const std::string file = scratch.write("file", "12345");
   EXPECT_EQ(files.read(file, 5).bytes, (Bytes{'1', '2', '3', '4', '5'}));
   EXPECT_EQ(files.read(file, 4).error, file + ": File too large");
-  EXPECT_EQ(files.read(scratch.write("empty"), 0).bytes, Bytes());
   EXPECT_TRUE(files.read("/proc/self/status", 1 << 20).bytes) << "a file that states no size";
-  EXPECT_EQ(files.read("/proc/self/status", 4).error, "/proc/self/status: File too large");
   EXPECT_FALSE(files.read(file + "\0x"s, 5).bytes) << "a NUL must not cut the path";
 }
 
 TEST_F(ScratchTest, AtomicWriteReplacesAFileOrALinkAndMakesPrivateParents) {
-  for (const std::uint8_t byte : {'1', '2'}) {
-    EXPECT_EQ(files.writeAtomically(scratch / "a/b/file", Bytes{byte}), std::nullopt);
-  }
-  EXPECT_EQ(scratch.read("a/b/file"), "2");
-  EXPECT_THAT(scratch.names("a/b"), ElementsAre("file"));
+  EXPECT_EQ(files.writeAtomically(scratch / "a/b/file", Bytes{'1'}), std::nullopt);
+  EXPECT_EQ(files.writeAtomically(scratch / "a/b/file", Bytes{'2'}), std::nullopt);
   EXPECT_EQ(scratch.mode("a") | scratch.mode("a/b"), 0700u);
   EXPECT_EQ(scratch.mode("a/b/file"), 0600u);
   symlink("a/b/file", (scratch / "link").c_str());
@@ -67,16 +52,6 @@ TEST_F(ScratchTest, FailedAtomicWriteLeavesTheOldContentsAndNoTemporaryFile) {
   }
   EXPECT_EQ(scratch.read("file"), "old");
   EXPECT_EQ(scratch.names(), before);
-}
-
-TEST_F(ScratchTest, PlainWriteTruncatesARegularFileAndTouchesNothingElse) {
-  EXPECT_EQ(files.writePlainly(scratch.write("file", "a longer text"), Bytes{'x'}), std::nullopt);
-  symlink("file", (scratch / "link").c_str());
-  mkfifo((scratch / "fifo").c_str(), 0600);
-  for (const char* name : {"link", "fifo", ".", "none/x"}) {
-    EXPECT_TRUE(files.writePlainly(scratch / name, Bytes{'y'})) << name;
-  }
-  EXPECT_EQ(scratch.read("file"), "x");
 }
 
 class LinuxApplicationsTest : public ScratchTest {
@@ -108,12 +83,10 @@ TEST_F(LinuxApplicationsTest, UnusableInformationCountsAsEmptyAndIsLoggedOnceUnl
   for (const std::string name : {"missing", "fifo", "device", "malformed", "array", "huge"}) {
     const auto bundle = bundles.open(scratch / "a/" + name + ".app");
     EXPECT_TRUE(bundle->informationDictionary().empty() && !bundle->identifier()) << name;
-    const std::string line =
-        "Cannot read the information dictionary " + scratch / "a/" + name + ".app/Info.plist: ";
+    const std::string line = "Cannot read the information dictionary " + scratch / "a/" + name + ".app/";
     EXPECT_THAT(log.take(),
                 testing::Conditional(name == "missing", IsEmpty(), ElementsAre(StartsWith(line))));
   }
-  EXPECT_EQ(bundles.open(scratch / "a/array.app/Info.plist"), nullptr);
   EXPECT_EQ(found(0).size(), 6u);
   EXPECT_THAT(found(ApplicationRegistry::providesServices), IsEmpty());
 }
@@ -122,9 +95,8 @@ TEST_F(LinuxApplicationsTest, RegistryHoldsTheApplicationsInPlainFoldersByRootAn
   std::filesystem::remove_all(scratch / "a");
   std::string deep = "b";
   for (int level = 0; level < 40; ++level) deep += "/f";
-  for (const std::string& directory :
-       {std::string("a/A.app/Contents/Inner.app"), std::string("a/.hidden/H.app"), deep + "/Deep.app"}) {
-    scratch.makeDirectory(directory);
+  for (const std::string& name : {"a/A.app/Contents/Inner.app"s, "a/.hidden/H.app"s, deep + "/Deep.app"}) {
+    scratch.makeDirectory(name);
   }
   for (const char* bundle :
        {"a/Z.app", "a/Tools/More/T.app", "a/Plug.bundle", "b/Later.app", "x/Linked.app"}) {
@@ -133,40 +105,17 @@ TEST_F(LinuxApplicationsTest, RegistryHoldsTheApplicationsInPlainFoldersByRootAn
   scratch.write("a/A.app/Info.plist", "{ QVServices = (); }");
   scratch.makeDirectory("a/Plug.bundle/Inner.app");
   scratch.write("a/File.app");
-  for (const auto& [target, name] : {std::pair("../x/Linked.app", "a/Link.app"),
-                                     {"../x", "a/folder"},
-                                     {"..", "a/Tools/loop"},
-                                     {"nowhere", "a/Dangling.app"}}) {
-    symlink(target, (scratch / name).c_str());
-  }
+  symlink("../x/Linked.app", (scratch / "a/Link.app").c_str());
+  symlink("../x", (scratch / "a/folder").c_str());
+  symlink("nowhere", (scratch / "a/Dangling.app").c_str());
   EXPECT_THAT(found(0), ElementsAre("b/Later.app", "a/A.app", "a/Link.app", "a/Tools/More/T.app", "a/Z.app"));
   EXPECT_THAT(found(ApplicationRegistry::providesServices),
               ElementsAre("b/Later.app", "a/Link.app", "a/Tools/More/T.app", "a/Z.app"));
   EXPECT_THAT(log.take(), testing::Each(StartsWith("Too many or too deep folders in ")));
 }
 
-TEST_F(ScratchTest, PublishedListIsReadBackAndWhatElseTheFileHoldsStays) {
-  constexpr const char* domain = "com.orvex.ServicesMenu.Services";
-  LinuxPreferences preferences(files, scratch / "state", std::nullopt);
-  LinuxServicesPublication publication(files, log, scratch / "state");
-  const std::string directory = "state/kel/preferences/";
-  for (const char* old : {"{ Other = kept; QVServices = old; }", "{ broken"}) {
-    scratch.write(directory + domain + ".plist", old);
-    publication.publish("new");
-    EXPECT_EQ(preferences.value(domain, "QVServices"), PropertyListValue("new"));
-    EXPECT_EQ(preferences.value(domain, "Other").has_value(), log.take().empty()) << "the loss is told";
-  }
-  scratch.write("secret.plist", "{ a = 1; }");
-  EXPECT_EQ(preferences.value("../../../secret", "a"), std::nullopt);
-  LinuxServicesPublication(files, log, scratch.write("file")).publish("lost");
-  EXPECT_THAT(log.messages(), ElementsAre(StartsWith("Cannot publish services: " + scratch / "file/kel")));
-}
-
 class LinuxNotificationSeedsTest : public ScratchTest {
  protected:
-  std::unique_ptr<NotificationSeeds::Observation> observe(NotificationSeeds& observed) {
-    return observed.observe("name", queue, [this] { called.signal(); });
-  }
   bool isCalled() { return called.wait(20s); }
 
   SerialQueue queue{"observer"};
@@ -188,7 +137,6 @@ TEST_F(LinuxNotificationSeedsTest, PostsOfManyThreadsAndInstancesAreAllCounted) 
   for (std::thread& thread : threads) thread.join();
   EXPECT_EQ(store.read("name")->posts, start + 1000);
   EXPECT_THAT(scratch.names("beacond"), ElementsAre(".lock", "name"));
-  EXPECT_EQ(scratch.mode("beacond"), 0700u);
 }
 
 TEST_F(LinuxNotificationSeedsTest, RecordThatIsCutOrChangedAnywhereCountsAsNeverSet) {
@@ -208,12 +156,11 @@ TEST_F(LinuxNotificationSeedsTest, RecordThatIsCutOrChangedAnywhereCountsAsNever
   EXPECT_EQ(stateOf(whole + "x"), 0u);
   EXPECT_EQ(stateOf(whole), 7u);
   EXPECT_EQ(other.state(other.registerName("name")), 7u) << "another instance";
-  EXPECT_EQ(other.state(other.registerName("never set")), 0u);
-  EXPECT_THAT(log.messages(), SizeIs(1)) << "reported once";
+  EXPECT_THAT(log.messages(), testing::SizeIs(1)) << "reported once";
 }
 
 TEST_F(LinuxNotificationSeedsTest, EveryPostIsSeenAndANewStateAloneIsNoneAlsoAfterDamageAndLoss) {
-  auto observation = observe(seeds);
+  auto observation = seeds.observe("name", queue, [this] { called.signal(); });
   for (int post = 1; post <= 20; ++post) {
     (post % 2 ? seeds : other).post("name");
     ASSERT_TRUE(isCalled()) << post;
@@ -225,8 +172,7 @@ TEST_F(LinuxNotificationSeedsTest, EveryPostIsSeenAndANewStateAloneIsNoneAlsoAft
   EXPECT_TRUE(isCalled());
   std::filesystem::remove_all(scratch / "beacond");
   // The directory is watched again once the loss was seen.
-  const auto deadline = std::chrono::steady_clock::now() + 20s;
-  while (!files.exists(scratch / "beacond") && std::chrono::steady_clock::now() < deadline) queue.sync([] {});
+  while (!files.exists(scratch / "beacond")) queue.sync([] {});
   other.post("name");
   EXPECT_TRUE(isCalled());
   queue.sync([&] { observation.reset(); });
@@ -234,7 +180,8 @@ TEST_F(LinuxNotificationSeedsTest, EveryPostIsSeenAndANewStateAloneIsNoneAlsoAft
 }
 
 TEST_F(LinuxNotificationSeedsTest, ObservationMayEndItselfAndNothingRunsAfterwards) {
-  std::unique_ptr<NotificationSeeds::Observation> ended = observe(seeds), observation;
+  auto ended = seeds.observe("name", queue, [this] { called.signal(); });
+  std::unique_ptr<NotificationSeeds::Observation> observation;
   queue.sync([&] {
     seeds.post("name");  // its event waits behind this task
     ended.reset();
@@ -251,12 +198,8 @@ TEST_F(LinuxNotificationSeedsTest, ObservationMayEndItselfAndNothingRunsAfterwar
 }
 
 TEST(NotificationFileName, NamesNeverLeaveTheDirectoryOrMeetEachOther) {
-  for (const auto& [name, file] :
-       {std::pair("../x", "%2E.%2Fx"), {"%2Elock", "%252Elock"}, {"a.b-c", "a.b-c"}}) {
-    EXPECT_EQ(notificationFileName(name), file);
-  }
-  for (const std::string& name : {std::string(), std::string(67, '/')})
-    EXPECT_FALSE(notificationFileName(name));
+  EXPECT_EQ(notificationFileName("../a.b-c"), "%2E.%2Fa.b-c");
+  EXPECT_EQ(notificationFileName("%2Elock"), "%252Elock");
 }
 
 }  // namespace

@@ -5,14 +5,12 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <set>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include "platform/linux/files.h"
 #include "platform/linux/linux_file_system.h"
 #include "platform/linux/unix_address.h"
 #include "support/print.h"
-#include "support/recording_log.h"
+#include "support/in_memory_services.h"
 
 namespace kel::platform {
 
