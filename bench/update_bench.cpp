@@ -4,6 +4,7 @@
 #include <benchmark/benchmark.h>
 #include <cstdlib>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <string>
 
@@ -56,7 +57,15 @@ void report(benchmark::State& state, kel::KELDataStore& store) {
   state.counters["services/s"] = benchmark::Counter(services, benchmark::Counter::kIsIterationInvariantRate);
 }
 
-void BM_ColdUpdate(benchmark::State& state) {
+using Work = void (*)(kel::KELDataStore&);
+
+void updateEverything(kel::KELDataStore& store) {
+  store.updateServicesCache(kel::KELStaleEverything);
+  benchmark::DoNotOptimize(store.currentPublicDictionaries());
+}
+
+/// Times `work` on a new store, without a cache file, each time; `before` is not timed.
+void measureOnNewStores(benchmark::State& state, Work before, Work work) {
   kel::platform::Platform* services = platform(state);
   if (!services) return;
   std::unique_ptr<kel::KELDataStore> store;
@@ -64,42 +73,44 @@ void BM_ColdUpdate(benchmark::State& state) {
     state.PauseTiming();
     if (store) store->flushCaches();
     store = kel::KELDataStore::initWithSystemServices(*services);
+    before(*store);
     state.ResumeTiming();
-    store->updateServicesCache(kel::KELStaleEverything);
-    benchmark::DoNotOptimize(store->currentPublicDictionaries());
+    work(*store);
   }
   report(state, *store);
+}
+
+/// Times `work` again and again on one store that has everything and its cache file.
+void measureOnAFullStore(benchmark::State& state, const std::function<void(kel::KELDataStore&)>& work) {
+  kel::platform::Platform* services = platform(state);
+  if (!services) return;
+  const auto store = kel::KELDataStore::initWithSystemServices(*services);
+  updateEverything(*store);
+  store->writeCaches();
+  for (auto _ : state) work(*store);
+  report(state, *store);
+}
+
+void BM_ColdUpdate(benchmark::State& state) {
+  measureOnNewStores(
+      state, [](kel::KELDataStore&) {}, updateEverything);
 }
 BENCHMARK(BM_ColdUpdate)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 void BM_RestartFromTheCache(benchmark::State& state) {
-  kel::platform::Platform* services = platform(state);
-  if (!services) return;
-  {
-    const auto writing = kel::KELDataStore::initWithSystemServices(*services);
-    writing->updateServicesCache(kel::KELStaleEverything);
-    writing->writeCaches();
-  }
-  std::unique_ptr<kel::KELDataStore> store;
-  for (auto _ : state) {
-    store = kel::KELDataStore::initWithSystemServices(*services);
-    benchmark::DoNotOptimize(store->currentPublicDictionaries());
-  }
-  report(state, *store);
+  measureOnAFullStore(state, [&state](kel::KELDataStore&) {
+    const auto restarted = kel::KELDataStore::initWithSystemServices(*platform(state));
+    benchmark::DoNotOptimize(restarted->currentPublicDictionaries());
+  });
 }
 BENCHMARK(BM_RestartFromTheCache)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 /// With `flags` as the stale sources: 0 asks nothing anew, 2 asks the journal.
 void BM_UpdateWithNothingChanged(benchmark::State& state) {
-  kel::platform::Platform* services = platform(state);
-  if (!services) return;
-  const auto store = kel::KELDataStore::initWithSystemServices(*services);
-  store->updateServicesCache(kel::KELStaleEverything);
-  for (auto _ : state) {
-    store->updateServicesCache(static_cast<kel::KELStaleCacheFlags>(state.range(0)));
-    benchmark::DoNotOptimize(store->currentPublicDictionaries());
-  }
-  report(state, *store);
+  measureOnAFullStore(state, [&state](kel::KELDataStore& store) {
+    store.updateServicesCache(static_cast<kel::KELStaleCacheFlags>(state.range(0)));
+    benchmark::DoNotOptimize(store.currentPublicDictionaries());
+  });
 }
 BENCHMARK(BM_UpdateWithNothingChanged)
     ->ArgName("flags")
@@ -109,26 +120,14 @@ BENCHMARK(BM_UpdateWithNothingChanged)
     ->UseRealTime();
 
 void BM_FetchALocalization(benchmark::State& state) {
-  kel::platform::Platform* services = platform(state);
-  if (!services) return;
-  std::unique_ptr<kel::KELDataStore> store;
-  for (auto _ : state) {
-    state.PauseTiming();
-    if (store) store->flushCaches();
-    store = kel::KELDataStore::initWithSystemServices(*services);
-    store->updateServicesCache(kel::KELStaleEverything);
-    state.ResumeTiming();
-    store->fetchLocalizations({{"German"}});
-  }
+  measureOnNewStores(state, updateEverything,
+                     [](kel::KELDataStore& store) { store.fetchLocalizations({{"German"}}); });
 }
 BENCHMARK(BM_FetchALocalization)->Unit(benchmark::kMillisecond)->UseRealTime();
 
+/// Making its contents; they are written in the background, and waited for at the end.
 void BM_WriteTheCacheFile(benchmark::State& state) {
-  kel::platform::Platform* services = platform(state);
-  if (!services) return;
-  const auto store = kel::KELDataStore::initWithSystemServices(*services);
-  store->updateServicesCache(kel::KELStaleEverything);
-  for (auto _ : state) store->writeCaches();
+  measureOnAFullStore(state, [](kel::KELDataStore& store) { store.writeCaches(); });
 }
 BENCHMARK(BM_WriteTheCacheFile)->Unit(benchmark::kMillisecond)->UseRealTime();
 

@@ -10,11 +10,11 @@
 namespace kel {
 namespace {
 
-using test::debugLines;
 using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListValue;
+using test::debugLines;
 using test::dictionary;
 using test::InMemoryPlatform;
 using testing::ElementsAre;

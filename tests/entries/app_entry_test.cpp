@@ -296,6 +296,9 @@ TEST_F(NormalisationTest, ValueThatCannotBeHandledCostsTheRestOfTheEntryOnly) {
   for (const Row& row : {
            Row{{{"service_dicts", "x"}}, 0, "the declared services are no array"},
            Row{{{"service_dicts", Array{titled, 7, titled}}}, 1, "service 1 is no dictionary"},
+           Row{{{"bundle_id", std::string(1 << 20, 'i')}, {"service_dicts", Array(20, titled)}},
+               15,
+               "its services are too large"},
            Row{{services, {"loc_to_menu_strings", 7}}, 1, "the localized menu strings are no dictionary"},
            Row{{services, {"loc_to_menu_strings", tables}},
                1,

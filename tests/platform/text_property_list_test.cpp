@@ -195,6 +195,11 @@ TEST(PropertyListDescriptionTest, AValueIsRenderedInTheTextEncoding) {
                           R"("\"\\\n\033\177\200)"
                           "\u00e9\U0001F600\uFFFD\"");
   for (std::size_t i = 0; i < values.size(); ++i) EXPECT_EQ(describe(values[i]), texts.at(i));
+
+  PropertyListValue deep = Array(50'000, PropertyListValue("\u00e9"));
+  for (int level = 0; level < 500; ++level) deep = Array{deep};
+  EXPECT_EQ(describeBriefly(deep, 4096).size(), 4096 + std::string_view(" [cut]").size());
+  EXPECT_EQ(describeBriefly("\u00e9", 2), "\" [cut]") << "cut within a character";
 }
 
 TEST(PropertyListReaderTest, TheEncodingIsFoundByTheBeginning) {

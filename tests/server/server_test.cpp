@@ -195,6 +195,25 @@ TEST_F(ServerTest, AFlushAnswersWithoutDataBeforeTheFileIsGoneAndTheNextGetLoads
   EXPECT_THAT(titles(), ElementsAre("One"));
 }
 
+TEST_F(ServerTest, AFlushOutlivesARebuildThatWasUnderWay) {
+  perform(get);
+  blockDataStore();
+  const Answer rebuilt = send(update);
+  send(request("flush"));
+  release();
+  rebuilt->wait();
+  drain();
+  EXPECT_EQ(server.currentData(), nullptr);
+}
+
+TEST_F(ServerTest, ClientsThatAskForEverNewLocalizationsDisplaceOthersAndShutNobodyOut) {
+  for (int i = 0; i < 300; ++i) send(localizations({"x" + std::to_string(i)}))->wait();
+  send(localizations({"de"}))->wait();
+  EXPECT_THAT(server.knownLoadedLocalizations(), testing::AllOf(SizeIs(256), testing::Contains("de")));
+  send(localizations({std::string(129, 'n'), "fr"}))->wait();
+  EXPECT_THAT(server.knownLoadedLocalizations(), Not(testing::Contains("fr"))) << "the first one decides";
+}
+
 TEST_F(ServerTest, OddRequestsAreCarriedOutOrAnsweredAllTheSame) {
   sendTo(server, update, false);
   drain();

@@ -314,6 +314,32 @@ TEST_F(ConduitTest, WithoutDescriptorsAConnectionIsGivenUpAndTheServerGoesOn) {
   EXPECT_THAT(log.messages(), ElementsAre(HasSubstr("out of descriptors")));
 }
 
+TEST_F(ConduitTest, BusyConnectionsBeyondTheLimitAreRefusedAndAnIdleOneGivesWay) {
+  rlimit before{};
+  getrlimit(RLIMIT_NOFILE, &before);
+  const rlimit few{64, before.rlim_max};  // a quarter of them may be connections
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &few), 0);
+  startServer();
+  queue.sync([] {});
+  setrlimit(RLIMIT_NOFILE, &before);
+  std::vector<RawPeer> peers;
+  for (int i = 0; i < 16; ++i) peers.emplace_back(socketPath).request(1, "hold");
+  for (std::size_t arrived = 0; arrived < 16;) {
+    std::unique_lock lock(mutex);
+    ASSERT_TRUE(changed.wait_for(lock, 30s, [&] { return requests >= 16; }));
+    arrived = requests;
+  }
+  EXPECT_TRUE(RawPeer(socketPath).isClosed());
+  EXPECT_THAT(log.take(), ElementsAre(HasSubstr("too many busy connections")));
+  {
+    const std::lock_guard lock(mutex);
+    held[0]->reply("done");
+  }
+  EXPECT_EQ(peers[0].reply(1), PropertyListValue("done"));
+  EXPECT_TRUE(isServing());
+  EXPECT_TRUE(peers[0].isClosed());
+}
+
 TEST_F(ConduitTest, ADroppedOrTooLargeRequestCostsOnlyItselfAndAServerThatGoesInterruptsIt) {
   startServer();
   Client client(makeConduit());

@@ -9,8 +9,8 @@
 #include "platform/linux/files.h"
 #include "platform/linux/linux_file_system.h"
 #include "platform/linux/unix_address.h"
-#include "support/print.h"
 #include "support/in_memory_services.h"
+#include "support/print.h"
 
 namespace kel::platform {
 
