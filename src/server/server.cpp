@@ -31,7 +31,11 @@ KELServer::~KELServer() = default;
 void KELServer::incrementServicesSeed() {
   std::uint64_t seed = 0;
   while (seed == 0) seed = ++notificationSeed_;
-  platform_.seeds.setState(notificationToken_, seed);
+  // The other queue may raise it meanwhile: whoever stores last stores the newest.
+  for (std::uint64_t stored = 0; stored != seed; seed = notificationSeed_) {
+    stored = seed;
+    platform_.seeds.setState(notificationToken_, stored);
+  }
   platform_.seeds.post(seedName_);
 }
 

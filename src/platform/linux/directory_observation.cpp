@@ -17,8 +17,13 @@ namespace kel::platform {
 // from the last one seen, so a lost or repeated event does no harm.
 class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watcher> {
  public:
-  Watcher(const NotificationStore& store, std::string name, SerialQueue& queue, std::function<void()> posted)
-      : store_(store.directory()), name_(std::move(name)), queue_(queue), posted_(std::move(posted)) {}
+  Watcher(const NotificationStore& store, std::string name, SerialQueue& queue, std::function<void()> posted,
+          SystemLog& log)
+      : store_(store.directory()),
+        name_(std::move(name)),
+        queue_(queue),
+        posted_(std::move(posted)),
+        log_(log) {}
 
   std::optional<std::string> start() {
     inotify_ = OwnedDescriptor(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
@@ -47,6 +52,7 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
     watch_ = queue_.loop().watch(inotify_.get(), EPOLLIN, [self = weak_from_this()](std::uint32_t) {
       if (const auto watcher = self.lock()) watcher->look();
     });
+    if (!watch_) log_.write("Cannot watch notifications: " + errorLine(store_.directory(), errno));
   }
 
   void look() {
@@ -76,6 +82,7 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
   const std::string name_;
   SerialQueue& queue_;
   const std::function<void()> posted_;
+  SystemLog& log_;
   OwnedDescriptor inotify_;
 
   // Set by `start`, then only on queue_.
@@ -85,8 +92,8 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
 };
 
 DirectoryObservation::DirectoryObservation(const NotificationStore& store, std::string name,
-                                           SerialQueue& queue, std::function<void()> posted)
-    : watcher_(std::make_shared<Watcher>(store, std::move(name), queue, std::move(posted))) {}
+                                           SerialQueue& queue, std::function<void()> posted, SystemLog& log)
+    : watcher_(std::make_shared<Watcher>(store, std::move(name), queue, std::move(posted), log)) {}
 
 DirectoryObservation::~DirectoryObservation() { watcher_->stop(); }
 

@@ -7,18 +7,19 @@
 
 #include "platform/linux/notification_store.h"
 #include "platform/notification_seeds.h"
+#include "platform/system_log.h"
 #include "platform/work_queue.h"
 
 namespace kel::platform {
 
 /// An observation of one name through its store's directory.
 ///
-/// Made and started on any thread, destroyed on `queue` or after it has ended. Borrows `queue`, which
-/// outlives it.
+/// Made and started on any thread, destroyed on `queue` or after it has ended. Borrows `queue` and
+/// `log`, which outlive it.
 class DirectoryObservation final : public NotificationSeeds::Observation {
  public:
   DirectoryObservation(const NotificationStore& store, std::string name, SerialQueue& queue,
-                       std::function<void()> posted);
+                       std::function<void()> posted, SystemLog& log);
   DirectoryObservation(const DirectoryObservation&) = delete;
   DirectoryObservation& operator=(const DirectoryObservation&) = delete;
   ~DirectoryObservation() override;

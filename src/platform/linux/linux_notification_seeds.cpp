@@ -52,7 +52,7 @@ void LinuxNotificationSeeds::post(const std::string& name) {
 
 std::unique_ptr<NotificationSeeds::Observation> LinuxNotificationSeeds::observe(
     const std::string& name, SerialQueue& queue, std::function<void()> posted) {
-  auto observation = std::make_unique<DirectoryObservation>(store_, name, queue, std::move(posted));
+  auto observation = std::make_unique<DirectoryObservation>(store_, name, queue, std::move(posted), log_);
   if (const auto error = observation->start()) log_.write("Cannot watch notifications: " + *error);
   return observation;
 }
