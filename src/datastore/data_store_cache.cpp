@@ -165,13 +165,13 @@ void KELDataStore::restoreLocators(const PropertyListDictionary& directories) {
 
 void KELDataStore::restoreAppEntries(const PropertyListDictionary& entries) {
   auto restored = std::make_shared<AppEntries>();
-  for (const auto& [path, representation] : entries) {
-    auto entry = KELAppEntry::initFromCacheRepresentation(platform_, representation, path.text());
+  for (const PropertyListDictionary::Entry& item : entries) {
+    const std::string& path = item.first.text();
+    auto entry = KELAppEntry::initFromCacheRepresentation(platform_, item.second, path);
     if (!entry) continue;
-    send_debug_line(
-        [&] { return "Loaded cached entry " + entry->description() + " for path " + path.text(); });
+    send_debug_line([&] { return "Loaded cached entry " + entry->description() + " for path " + path; });
     entry->setServicesCacheIsValid(true);
-    restored->emplace(path.text(), std::move(entry));
+    restored->emplace(path, std::move(entry));
   }
   pathsToAppEntries_ = std::move(restored);
 }

@@ -296,7 +296,10 @@ TEST_F(ReactorTest, ABurstAfterQuietGivesOneReactionAtOnce) {
   perform(update);
   clearFlags();
   for (int i = 0; i < 10; ++i)
-    server.conduitQueue().async([this] { server.reactToAppRegistryDatabaseChange(); });
+    server.conduitQueue().async([this] {
+      server.conduitQueue().assertCurrent();
+      server.reactToAppRegistryDatabaseChange();
+    });
   drain();
   EXPECT_EQ(newPosts(), 1U);
   change();

@@ -65,7 +65,8 @@ class RawPeer {
   std::optional<PropertyListValue> reply(std::uint64_t tag) {
     const Bytes header = receive(16);
     if (header.size() < 16) return "closed by the server";
-    const std::size_t length = std::size_t{header[0]} << 24 | header[1] << 16 | header[2] << 8 | header[3];
+    std::size_t length = 0;
+    for (const std::uint8_t byte : BytesView(header).first(4)) length = length << 8 | byte;
     EXPECT_EQ(header, rawFrame(static_cast<std::uint32_t>(length), length == 0 ? 3 : 2, tag, {}));
     return length == 0 ? std::nullopt : readBinaryPropertyList(receive(length)).value;
   }
