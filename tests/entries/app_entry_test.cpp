@@ -209,7 +209,7 @@ TEST_F(NormalisationTest, KeysAreCarriedOverInTheirCanonicalFormWhenTheirValueIs
     Array kept;
     Array dropped;
   };
-  const Array array{"a"};
+  const Value array(Array{"a"});
   for (const Row& row : {
            Row{{"QVMessage", "QVPortName", "QVHost", "QVUserData"}, {"a", ""}, {1, array}},
            Row{{"QVSendTypes", "QVReturnTypes", "QVLanguages"}, {array}, {1, "a"}},
