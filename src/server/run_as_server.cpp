@@ -60,6 +60,8 @@ void subscribeToLaunchEvents(platform::Platform& platform, KELServer& server) {
 int run_as_server(platform::Platform& platform) {
   platform.conduit.trackActivity();
   KELServer server(platform);
+  // Before the endpoint is there: whoever can reach the server can also end it with success.
+  platform.process.onTermination([&platform] { platform.process.exitNow(0); });
   platform::ConduitListening listening;
   // On the queue itself: the streams' first events, queued here, run before the first request is read.
   server.conduitQueue().sync([&] {
@@ -70,7 +72,6 @@ int run_as_server(platform::Platform& platform) {
     platform.log.write("run_as_server: kel message error: " + listening.error);
     return listening.servedElsewhere ? 0 : 1;
   }
-  platform.process.onTermination([&platform] { platform.process.exitNow(0); });
   platform.process.runMainLoop();
   server.conduitQueue().sync([&] { listening.listener.reset(); });
   return 0;
