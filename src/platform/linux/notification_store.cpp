@@ -56,7 +56,7 @@ std::optional<NotificationRecord> readRecord(int directory, const std::string& f
 
 /// Holders keep the lock for microseconds; one that does not let go must not stop the caller.
 bool lockInTime(int lock) {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(250);
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(2);
   while (flock(lock, LOCK_EX | LOCK_NB) != 0) {
     const int error = errno;
     if ((error != EWOULDBLOCK && error != EINTR) || std::chrono::steady_clock::now() > deadline) {
