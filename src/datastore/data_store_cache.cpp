@@ -1,4 +1,3 @@
-#include <limits>
 #include <utility>
 
 #include "common/common.h"

@@ -31,11 +31,6 @@ class KELRestrictionListEntry {
   /// The hash of the title alone.
   std::size_t hash() const;
 
-  /// For hashed containers.
-  struct Hash {
-    std::size_t operator()(const KELRestrictionListEntry& entry) const { return entry.hash(); }
-  };
-
  private:
   KELRestrictionListEntry(platform::PropertyListString bundleID, platform::PropertyListString title);
 
