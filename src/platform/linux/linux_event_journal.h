@@ -1,25 +1,67 @@
 #pragma once
 
-#include <atomic>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
 
 #include "platform/event_journal.h"
+#include "platform/file_system.h"
+#include "platform/linux/change_log.h"
+#include "platform/linux/journal_keeper.h"
+#include "platform/system_log.h"
+#include "platform/work_queue.h"
 
 namespace kel::platform {
 
-/// A journal that counts positions and remembers no events: it can make no stream, so that whoever asks what
-/// changed is told nothing and has to look at everything anew. Without an index every update is a full
-/// rescan. Any thread.
-class LinuxEventJournal final : public EventJournal {
+class JournalService;
+
+/// The file-system event journal, of the directories it is told to watch: see docs/journal.md.
+///
+/// A question is answered from memory where the kernel's events tell all, and by comparing the disk with what
+/// is remembered elsewhere; where neither can tell, the answer says so. Any thread. Borrows `files`, `log`
+/// and `pool`, which outlive it.
+class LinuxEventJournal final : public EventJournal, public ChangeLog {
  public:
-  /// The coarse real-time clock in nanoseconds, but always past every position given before.
+  /// What changed, told as it happens; on the journal's own queue.
+  using ChangeHandler = std::function<void(JournalForest::Hints)>;
+
+  LinuxEventJournal(JournalOptions options, FileSystem& files, SystemLog& log, ConcurrentQueue& pool);
+
+  /// Writes the index file when it lags behind. No stream and no other call may be left.
+  ~LinuxEventJournal() override;
+
+  /// What to watch. Before everything else.
+  void setRoots(std::vector<WatchedRoot> roots) { roots_ = std::move(roots); }
+
+  /// Begins to watch, in the background; `changed` is called for what happens from then on. Without this call
+  /// the first question begins it. At most once. False when there is no thread to be had: then changes are
+  /// not told, and no stream is made.
+  bool start(ChangeHandler changed);
+
+  /// Waits, five seconds at most, for what has to be looked at. Safe to compare over restarts.
   EventID currentEventID() override;
 
   std::unique_ptr<JournalStream> createStream(JournalCallback callback, const std::vector<std::string>& paths,
                                               EventID since, std::chrono::nanoseconds latency,
                                               std::uint32_t flags) override;
 
+  bool changedSince(const std::vector<std::string>& paths, EventID since) override;
+
  private:
-  std::atomic<EventID> last_ = 0;
+  class Stream;
+
+  JournalService* service();
+
+  const JournalOptions options_;
+  FileSystem& files_;
+  SystemLog& log_;
+  ConcurrentQueue& pool_;
+  std::vector<WatchedRoot> roots_;
+  std::once_flag started_;
+  std::unique_ptr<JournalService> service_;  // null when there is no thread for it
 };
 
 }  // namespace kel::platform

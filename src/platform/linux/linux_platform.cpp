@@ -9,6 +9,12 @@ std::string recordDirectory(const RuntimeDirectory& runtime) {
   return runtime.path ? joinPath(*runtime.path, "beacond") : "/dev/null/beacond";
 }
 
+JournalOptions journalOptions(const std::optional<std::string>& stateDirectory) {
+  JournalOptions options;
+  if (stateDirectory) options.directory = joinPath(*stateDirectory, "kel");
+  return options;
+}
+
 }  // namespace
 
 LinuxPlatform::LinuxPlatform()
@@ -26,6 +32,7 @@ LinuxPlatform::LinuxPlatform()
       preferences_(files_, directories_.stateDirectory(), directories_.configurationDirectory()),
       applications_(files_, log_, concurrentQueue_,
                     LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory())),
+      journal_(journalOptions(directories_.stateDirectory()), files_, log_, concurrentQueue_),
       platform_{clock_,       concurrentQueue_, files_,        directories_, bundles_,      facts_,
                 log_,         transactions_,    conduit_,      sandbox_,     launchEvents_, seeds_,
                 publication_, preferences_,     applications_, journal_,     process_,      constants_} {

@@ -1,0 +1,160 @@
+#include "platform/linux/journal_keeper.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "platform/linux/journal_index.h"
+#include "platform/linux/sealed_bytes.h"
+
+namespace kel::platform {
+
+namespace {
+
+using LookMode = JournalForest::LookMode;
+
+constexpr std::string_view positionFormat = "kel journal position 1";
+
+}  // namespace
+
+JournalKeeper::JournalKeeper(std::vector<WatchedRoot> roots, const JournalOptions& options, FileSystem& files,
+                             SystemLog& log, ConcurrentQueue& pool)
+    : options_(options),
+      roots_(std::move(roots)),
+      files_(files),
+      log_(log),
+      forest_(
+          roots_, options.limits, [this] { return newID(); }, log, pool) {
+  if (!options_.directory) return;
+  indexPath_ = joinPath(*options_.directory, "journal");
+  positionPath_ = joinPath(*options_.directory, "journal-position");
+}
+
+void JournalKeeper::open() {
+  if (!keepsIndex()) return;
+  const FileReading position = files_.read(positionPath_, 4096);
+  auto reader = position.bytes ? ByteReader::open(*position.bytes, positionFormat) : std::nullopt;
+  if (!reader) {
+    // Without it an index may be older than positions that were given out: events would get smaller ones.
+    if (position.bytes) log_.write(positionPath_ + ": damaged, starting without a journal");
+    files_.remove(indexPath_);
+    return;
+  }
+  lastID_ = reader->number();
+  const FileReading file = files_.read(indexPath_, largestOwnFile);
+  if (!file.bytes) return;
+  auto index = decodeIndex(*file.bytes, roots_);
+  if (!index) return log_.write(indexPath_ + ": damaged or of another version, starting without it");
+  lastID_ = std::max(lastID_, index->lastID);
+  forest_.restore(std::move(index->trees));
+  savedEvent_ = latestEvent();
+}
+
+EventID JournalKeeper::newID() {
+  lastID_ = std::max(lastID_ + 1, static_cast<EventID>(std::max<std::int64_t>(options_.now(), 0)));
+  return lastID_;
+}
+
+/// The index file is written now and then; positions are safe from being given out twice at once.
+void JournalKeeper::reserve(EventID id) {
+  constexpr EventID ahead = 600'000'000'000;
+  if (id <= reservedID_ || !keepsIndex()) return;
+  reservedID_ = id + ahead;
+  ByteWriter writer;
+  writer.number(reservedID_);
+  if (const auto error = files_.writeAtomically(positionPath_, writer.sealed(positionFormat))) {
+    if (!std::exchange(failureReported_, true)) log_.write("Cannot keep the journal's position: " + *error);
+  }
+}
+
+EventID JournalKeeper::currentEventID() {
+  settle(allTrees());
+  const EventID id = newID();
+  reserve(id);
+  return id;
+}
+
+bool JournalKeeper::settle(const std::vector<JournalTree*>& trees) {
+  const auto deadline = std::chrono::steady_clock::now() + options_.longestLook;
+  forest_.readEvents();
+  forest_.questionUncovered(trees);
+  bool isLeft = true;
+  while ((isLeft = forest_.lookAtSome(trees, LookMode::InParallel)) &&
+         std::chrono::steady_clock::now() < deadline) {
+  }
+  noteHorizons();
+  return !isLeft;
+}
+
+void JournalKeeper::noteHorizons() {
+  for (const auto& tree : forest_.trees()) {
+    const bool isFirst = tree->horizon == JournalTree::noHorizon;
+    if (isFirst && tree->pending.empty() && !tree->isTooLarge) tree->horizon = newID();
+  }
+}
+
+std::vector<JournalEvent> JournalKeeper::eventsSince(EventID since, const std::vector<std::string>& paths,
+                                                     bool watchesRoot) {
+  if (since > lastID_) return {{paths.empty() ? "" : paths.front(), event_flags::eventIDsWrapped, lastID_}};
+  std::vector<JournalTree*> trees;
+  for (const std::string& path : paths) {
+    JournalTree* tree = treeOf(path);
+    if (!tree) return {{path, event_flags::mustScanSubDirectories, lastID_}};
+    if (std::find(trees.begin(), trees.end(), tree) == trees.end()) trees.push_back(tree);
+  }
+  settle(trees);
+  std::vector<JournalEvent> events;
+  for (const std::string& path : paths) {
+    const JournalTree& tree = *treeOf(path);
+    bool rootChanged = false;
+    if (tree.knowsSince(since)) tree.addEvents(path, since, events, rootChanged);
+    if (!tree.knowsSince(since) || (rootChanged && !watchesRoot)) {
+      return {{path, event_flags::mustScanSubDirectories, lastID_}};
+    }
+  }
+  return events;
+}
+
+bool JournalKeeper::lookInBackground() {
+  forest_.readEvents();
+  const bool isLeft = forest_.lookAtSome(allTrees(), LookMode::InBackground);
+  noteHorizons();
+  return isLeft;
+}
+
+Bytes JournalKeeper::indexFile() {
+  forest_.readEvents();
+  forest_.questionUnsettled();
+  const auto deadline = std::chrono::steady_clock::now() + options_.longestLook;
+  while (forest_.lookAtSome(allTrees(), LookMode::ForGood) && std::chrono::steady_clock::now() < deadline) {
+  }
+  noteHorizons();
+  // A record must not be newer than the events that are kept with it.
+  forest_.readEvents();
+  savedEvent_ = latestEvent();
+  return encodeIndex(lastID_, forest_.trees());
+}
+
+std::vector<JournalTree*> JournalKeeper::allTrees() const {
+  std::vector<JournalTree*> trees;
+  for (const auto& tree : forest_.trees()) trees.push_back(tree.get());
+  return trees;
+}
+
+JournalTree* JournalKeeper::treeOf(const std::string& path) const {
+  JournalTree* found = nullptr;
+  for (const auto& tree : forest_.trees()) {
+    if (tree->covers(path) && (!found || found->path().size() < tree->path().size())) found = tree.get();
+  }
+  return found;
+}
+
+EventID JournalKeeper::latestEvent() const {
+  EventID latest = 0;
+  for (const auto& tree : forest_.trees()) {
+    latest = std::max(latest, tree->root().latest);
+    if (tree->horizon != JournalTree::noHorizon) latest = std::max(latest, tree->horizon);
+  }
+  return latest;
+}
+
+}  // namespace kel::platform
