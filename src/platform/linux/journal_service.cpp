@@ -64,6 +64,8 @@ JournalService::~JournalService() {
 }
 
 void JournalService::setChangeHandler(ChangeHandler changed) {
+  if (!changed) return queue_.sync([this] { changed_ = nullptr; });
+  // Not waited for: the queue may be reading the index.
   queue_.async([this, changed = std::move(changed)]() mutable { changed_ = std::move(changed); });
 }
 

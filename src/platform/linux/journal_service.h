@@ -66,7 +66,8 @@ class JournalService {
   JournalService& operator=(const JournalService&) = delete;
   ~JournalService();
 
-  /// `changed` is called, on the journal's thread, when something happens.
+  /// `changed` is called, on the journal's thread, when something happens. Without one no earlier one is
+  /// called once this has returned.
   void setChangeHandler(ChangeHandler changed);
 
   EventID currentEventID();

@@ -1,69 +1,25 @@
 #include "platform/linux/linux_application_registry.h"
 
 #include <algorithm>
-#include <fcntl.h>
-#include <string_view>
+#include <time.h>
+#include <utility>
 
 #include "platform/linux/files.h"
-#include "platform/unicode.h"
 
 namespace kel::platform {
 
-namespace {
+LinuxApplicationRegistry::LinuxApplicationRegistry(FileSystem& files, SystemLog& log, ConcurrentQueue& queue,
+                                                   std::vector<std::string> roots,
+                                                   const std::optional<std::string>& stateDirectory,
+                                                   ChangeLog* changes)
+    : files_(files),
+      log_(log),
+      queue_(queue),
+      roots_(std::move(roots)),
+      database_(stateDirectory ? std::optional(joinPath(*stateDirectory, "kel/applications")) : std::nullopt),
+      changes_(changes) {}
 
-/// Walks one application directory. Recursion ends at the depth limit, the whole walk at the folder limit.
-class ApplicationScan {
- public:
-  void walk(const std::string& folder, int depth = 0) {
-    constexpr int deepest = 16;
-    constexpr std::size_t mostFolders = 50'000;
-    if (depth > deepest || ++folders_ > mostFolders) {
-      incomplete_ = true;
-      return;
-    }
-    for (const std::string& subfolder : list(folder, depth)) walk(subfolder, depth + 1);
-  }
-
-  std::vector<std::string> takeApplications() {
-    std::sort(applications_.begin(), applications_.end());
-    return std::move(applications_);
-  }
-
-  /// True when a limit cut the walk short.
-  bool incomplete() const { return incomplete_; }
-
- private:
-  /// Notes the applications in `folder` and returns its plain subfolders: none when it is itself a bundle.
-  std::vector<std::string> list(const std::string& folder, int depth) {
-    const DirectoryListing listing = openListing(folder);
-    std::vector<std::string> found;
-    std::vector<std::string> subfolders;
-    while (const dirent* entry = listing ? readdir(listing.get()) : nullptr) {
-      const std::string_view name(entry->d_name);
-      if (name.starts_with('.') || !isValidUTF8(name)) continue;
-      if (depth > 0 && name == "Info.plist") return {};
-      const bool isApplication = name.ends_with(".app");
-      if (!isDirectoryEntry(dirfd(listing.get()), *entry, isApplication)) continue;
-      (isApplication ? found : subfolders).push_back(joinPath(folder, name));
-    }
-    std::move(found.begin(), found.end(), std::back_inserter(applications_));
-    return subfolders;
-  }
-
-  static bool isDirectoryEntry(int folder, const dirent& entry, bool followLink) {
-    if (entry.d_type == DT_DIR) return true;
-    if (entry.d_type != DT_UNKNOWN && !(entry.d_type == DT_LNK && followLink)) return false;
-    struct stat status {};
-    return fstatat(folder, entry.d_name, &status, followLink ? 0 : AT_SYMLINK_NOFOLLOW) == 0 &&
-           S_ISDIR(status.st_mode);
-  }
-
-  std::vector<std::string> applications_;
-  std::size_t folders_ = 0;
-  bool incomplete_ = false;
-};
-
-}  // namespace
+LinuxApplicationRegistry::~LinuxApplicationRegistry() { background_.wait(); }
 
 std::vector<std::string> LinuxApplicationRegistry::applicationDirectories(const std::string& home) {
   return {"/System/Applications/", "/Network/Applications/", "/Applications/",
@@ -72,34 +28,134 @@ std::vector<std::string> LinuxApplicationRegistry::applicationDirectories(const 
 
 std::vector<RegisteredApplication> LinuxApplicationRegistry::applications(std::uint32_t mask,
                                                                           std::uint32_t value) {
-  const std::vector<std::string> paths = findApplications();
-  std::vector<std::uint32_t> flags(paths.size());
-  queue_.apply(paths.size(), [&](std::size_t index) { flags[index] = informationFlags(paths[index]); });
+  const Applications all = current();
   std::vector<RegisteredApplication> result;
-  for (std::size_t index = 0; index < paths.size(); ++index) {
-    if ((flags[index] & mask) == value) result.push_back({paths[index]});
+  for (const Application& application : *all) {
+    if ((application.flags & mask) == value) result.push_back({application.path});
   }
   return result;
 }
 
-std::vector<std::string> LinuxApplicationRegistry::findApplications() {
-  std::vector<std::string> paths;
-  for (const std::string& root : roots_) {
-    ApplicationScan scan;
-    scan.walk(root);
-    if (scan.incomplete())
-      log_.write("Too many or too deep folders in " + root + ": applications may be missing");
-    std::ranges::move(scan.takeApplications(), std::back_inserter(paths));
-  }
-  return paths;
+void LinuxApplicationRegistry::seed(std::function<void()> done) {
+  background_.async(queue_, [this, done = std::move(done)] {
+    current();
+    done();
+  });
 }
 
-std::uint32_t LinuxApplicationRegistry::informationFlags(const std::string& application) {
-  const std::string path = joinPath(application, "Info.plist");
-  const DictionaryReading reading = readDictionaryFile(files_, path, largestForeignFile, bundleFileLimits);
-  const PropertyListValue* services = reading.dictionary ? reading.dictionary->find("QVServices") : nullptr;
-  const PropertyListArray* array = services ? services->asArray() : nullptr;
-  return array && !array->empty() ? providesServices : 0;
+LinuxApplicationRegistry::Applications LinuxApplicationRegistry::current() {
+  const std::lock_guard lock(scanning_);
+  if (!lastScanHolds()) last_ = scan();
+  return last_.applications;
+}
+
+bool LinuxApplicationRegistry::lastScanHolds() const {
+  return last_.position != 0 && !changes_->changedSince(roots_, last_.position) &&
+         std::ranges::all_of(last_.outsiders,
+                             [](const Outsider& known) { return Outsider::at(known.path) == known; });
+}
+
+LinuxApplicationRegistry::Scan LinuxApplicationRegistry::scan() {
+  const EventID position = changes_ ? changes_->currentEventID() : 0;
+  if (!memory_) loadDatabase();
+  ApplicationWalk walk = walkRoots();
+  const std::size_t count = walk.applications.size();
+  std::vector<Look> looks(count);
+  queue_.apply(count, [&](std::size_t index) { looks[index] = lookAt(walk.applications[index].path); });
+
+  Scan result;
+  RememberedApplications settled;
+  std::vector<Application> applications;
+  applications.reserve(count);
+  bool isFinal = !walk.incomplete;
+  for (std::size_t index = 0; index < count; ++index) {
+    auto& [path, isLink] = walk.applications[index];
+    const Look& look = looks[index];
+    isFinal = isFinal && look.isSettled;
+    if (look.isSettled) settled.emplace_hint(settled.end(), path, look.application);
+    if (isLink || look.isLink) result.outsiders.push_back({path, true, look.application.information});
+    applications.push_back({std::move(path), look.application.flags});
+  }
+  for (std::string& path : walk.deadLinks) result.outsiders.push_back({std::move(path), false, {}});
+  result.applications = std::make_shared<const std::vector<Application>>(std::move(applications));
+  if (isFinal) result.position = position;
+  remember(std::move(settled));
+  return result;
+}
+
+ApplicationWalk LinuxApplicationRegistry::walkRoots() {
+  ApplicationWalk all;
+  for (const std::string& root : roots_) {
+    ApplicationWalk walk = walkApplications(root);
+    if (walk.reachedLimit)
+      log_.write("Too many or too deep folders in " + root + ": applications may be missing");
+    all.incomplete = all.incomplete || walk.incomplete;
+    std::ranges::move(walk.applications, std::back_inserter(all.applications));
+    std::ranges::move(walk.deadLinks, std::back_inserter(all.deadLinks));
+  }
+  return all;
+}
+
+LinuxApplicationRegistry::Outsider LinuxApplicationRegistry::Outsider::at(const std::string& path) {
+  return {path, platform::isDirectory(path), informationStatus(path).identity};
+}
+
+LinuxApplicationRegistry::Look LinuxApplicationRegistry::lookAt(const std::string& application) const {
+  const InformationStatus before = informationStatus(application);
+  const auto known = memory_->find(application);
+  if (before.isKnown && known != memory_->end() && known->second.information == before.identity)
+    return {known->second, true, before.isLink};
+
+  Look look{{before.identity, 0}, before.isKnown, before.isLink};
+  if (!before.identity) return look;
+  timespec now{};
+  clock_gettime(CLOCK_REALTIME_COARSE, &now);
+  look.isSettled = !isRacy(before.changeTime, now);
+  if (!before.isReadable) return look;
+  const FileReading file = files_.read(informationPath(application), largestForeignFile);
+  look.application.flags = file.bytes ? informationFlags(*file.bytes) : 0;
+  look.isSettled = look.isSettled && file.bytes && informationStatus(application).identity == before.identity;
+  return look;
+}
+
+void LinuxApplicationRegistry::remember(RememberedApplications settled) {
+  if (settled == *memory_ && !databaseIsUnusable_) return;
+  memory_ = std::make_shared<const RememberedApplications>(std::move(settled));
+  databaseIsUnusable_ = false;
+  if (!database_) return;
+  const bool isWriting = unwritten_.with([this](Unwritten& unwritten) {
+    unwritten.memory = memory_;
+    return std::exchange(unwritten.isWriting, true);
+  });
+  if (!isWriting) background_.async(queue_, [this] { writeDatabase(); });
+}
+
+void LinuxApplicationRegistry::loadDatabase() {
+  ApplicationDatabaseReading reading{RememberedApplications(), {}};
+  if (database_ && files_.exists(*database_)) {
+    const FileReading file = files_.read(*database_, largestApplicationDatabase);
+    reading =
+        file.bytes ? decodeApplications(*file.bytes) : ApplicationDatabaseReading{std::nullopt, file.error};
+  }
+  databaseIsUnusable_ = !reading.applications;
+  if (databaseIsUnusable_)
+    log_.write("Ignoring the application database " + *database_ + ": " + reading.error);
+  memory_ = std::make_shared<const RememberedApplications>(
+      std::move(reading.applications).value_or(RememberedApplications()));
+}
+
+void LinuxApplicationRegistry::writeDatabase() {
+  const auto next = [this] {
+    return unwritten_.with([](Unwritten& unwritten) {
+      unwritten.isWriting = unwritten.memory != nullptr;
+      return std::exchange(unwritten.memory, nullptr);
+    });
+  };
+  while (const Memory memory = next()) {
+    const auto bytes = encodeApplications(*memory);
+    const auto error = bytes ? files_.writeAtomically(*database_, *bytes) : "too many applications";
+    if (error) log_.write("Cannot remember the applications: " + *error);
+  }
 }
 
 }  // namespace kel::platform

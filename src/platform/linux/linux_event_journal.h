@@ -37,8 +37,9 @@ class LinuxEventJournal final : public EventJournal, public ChangeLog {
   void setRoots(std::vector<WatchedRoot> roots) { roots_ = std::move(roots); }
 
   /// Begins to watch, in the background; `changed` is called for what happens from then on. Without this call
-  /// the first question begins it. At most once. False when there is no thread to be had: then changes are
-  /// not told, and no stream is made.
+  /// the first question begins it. A further call without a handler ends that: none is called once
+  /// it has returned. False when there is no thread to be had: then changes are not told, and no stream
+  /// is made.
   bool start(ChangeHandler changed);
 
   /// Waits, five seconds at most, for what has to be looked at. Safe to compare over restarts.

@@ -1,5 +1,7 @@
 #include "platform/linux/linux_platform.h"
 
+#include <utility>
+
 namespace kel::platform {
 
 namespace {
@@ -27,16 +29,27 @@ LinuxPlatform::LinuxPlatform()
                {.trackActivity = [this] { transactions_.trackActivity(); },
                 .runtimeDirectory = [this] { return runtimeDirectory_; }}),
       seeds_(recordDirectory(runtimeDirectory_), log_),
-      launchEvents_(seeds_, log_),
       publication_(files_, log_, directories_.stateDirectory()),
       preferences_(files_, directories_.stateDirectory(), directories_.configurationDirectory()),
-      applications_(files_, log_, concurrentQueue_,
-                    LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory())),
       journal_(journalOptions(directories_.stateDirectory()), files_, log_, concurrentQueue_),
+      applications_(files_, log_, concurrentQueue_,
+                    LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory()),
+                    directories_.stateDirectory(), &journal_),
+      launchEvents_(seeds_, log_, journal_, applications_),
       platform_{clock_,       concurrentQueue_, files_,        directories_, bundles_,      facts_,
                 log_,         transactions_,    conduit_,      sandbox_,     launchEvents_, seeds_,
                 publication_, preferences_,     applications_, journal_,     process_,      constants_} {
   if (!runtimeDirectory_.path) log_.write("No runtime directory: " + runtimeDirectory_.error);
+}
+
+void LinuxPlatform::watchServiceDirectories(const std::vector<std::string>& directories) {
+  std::vector<WatchedRoot> roots;
+  for (const std::string& directory : directories) roots.push_back({directory, false});
+  for (std::string& directory :
+       LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory())) {
+    roots.push_back({std::move(directory), true});
+  }
+  journal_.setRoots(std::move(roots));
 }
 
 }  // namespace kel::platform

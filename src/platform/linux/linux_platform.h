@@ -2,6 +2,7 @@
 
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/linux/linux_application_registry.h"
 #include "platform/linux/linux_bundles.h"
@@ -37,6 +38,10 @@ class LinuxPlatform {
 
   Platform& platform() { return platform_; }
 
+  /// The directories, paths with a trailing "/", in which the journal watches for services, beside those of
+  /// the applications. Before the journal is used; nothing is watched before.
+  void watchServiceDirectories(const std::vector<std::string>& directories);
+
  private:
   // In the order of need: each borrows only what stands before it.
   LinuxProcess process_;
@@ -52,11 +57,11 @@ class LinuxPlatform {
   LinuxConduit conduit_;
   LinuxSandboxQuery sandbox_;
   LinuxNotificationSeeds seeds_;
-  LinuxLaunchEvents launchEvents_;
   LinuxServicesPublication publication_;
   LinuxPreferences preferences_;
-  LinuxApplicationRegistry applications_;
   LinuxEventJournal journal_;
+  LinuxApplicationRegistry applications_;
+  LinuxLaunchEvents launchEvents_;
   ProcessConstants constants_;
   Platform platform_;
 };

@@ -67,7 +67,8 @@ class LinuxApplicationsTest : public ScratchTest {
 
   /// The paths of the applications found, below the scratch directory.
   std::vector<std::string> found(std::uint32_t flags) {
-    LinuxApplicationRegistry registry(files, log, queue, {scratch / "b/", scratch / "a/", scratch / "none/"});
+    LinuxApplicationRegistry registry(files, log, queue, {scratch / "b/", scratch / "a/", scratch / "none/"},
+                                      std::nullopt, nullptr);
     std::vector<std::string> result;
     for (const RegisteredApplication& application : registry.applications(flags, flags)) {
       result.push_back(application.path.value().substr(scratch.path().size() + 1));
