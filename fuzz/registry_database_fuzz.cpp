@@ -1,5 +1,5 @@
-// The application database: what is read must be what the writer writes. The input is taken as a whole file and
-// as a payload, whose digest is made to fit.
+// The application database: what is read must be what the writer writes. The input is taken as a whole file
+// and as a payload, whose digest is made to fit.
 
 #include <algorithm>
 #include <cstddef>
