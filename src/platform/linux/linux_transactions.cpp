@@ -1,50 +1,84 @@
 #include "platform/linux/linux_transactions.h"
 
 #include <cassert>
-#include <string_view>
+#include <cerrno>
+#include <chrono>
+#include <sys/socket.h>
+
+#include "platform/linux/thread.h"
 
 namespace kel::platform {
+
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr auto reportInterval = 20ms;
+
+}  // namespace
 
 LinuxTransactions::LinuxTransactions(const std::optional<std::string>& notificationSocket)
     : address_(notificationSocket ? unixAddress(*notificationSocket) : std::nullopt) {
   if (address_) socket_ = OwnedDescriptor(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
 }
 
+LinuxTransactions::~LinuxTransactions() {
+  {
+    const std::lock_guard lock(mutex_);
+    ending_ = true;
+  }
+  changed_.notify_one();
+  if (reporter_.joinable()) reporter_.join();
+}
+
 void LinuxTransactions::open() {
-  if (count_.fetch_add(1) == 0) report();
+  {
+    const std::lock_guard lock(mutex_);
+    ++count_;
+  }
+  changed_.notify_one();
 }
 
 void LinuxTransactions::close() {
-  const std::uint64_t before = count_.fetch_sub(1);
-  assert(before > 0);
-  if (before == 1) report();
+  {
+    const std::lock_guard lock(mutex_);
+    assert(count_ > 0);
+    --count_;
+  }
+  changed_.notify_one();
 }
 
 void LinuxTransactions::trackActivity() {
-  tracking_ = true;
-  report();
+  if (socket_) reporter_ = startThread("launcher", [this] { reportChanges(); });
 }
 
-// Of several threads that have something to report one reports, the others only leave word: so reports arrive
-// in order, the last one is true, and no thread waits for another.
-void LinuxTransactions::report() {
-  if (!tracking_ || !socket_ || reporters_.fetch_add(1) != 0) return;
-  std::uint64_t seen = 0;
-  do {
-    seen = reporters_;
-    const bool busy = count_ != 0;
-    if ((!toldReady_ || busy != toldBusy_) && send(busy)) {
-      toldReady_ = true;
-      toldBusy_ = busy;
-    }
-  } while (reporters_.fetch_sub(seen) != seen);
+void LinuxTransactions::reportChanges() {
+  bool toldReady = false;
+  std::optional<std::uint64_t> told;
+  std::unique_lock lock(mutex_);
+  while (!ending_) {
+    const std::uint64_t count = count_;
+    lock.unlock();
+    const Report result = report(!toldReady, count);
+    if (result == Report::Taken) toldReady = true;
+    if (result != Report::KeptBack) told = count;
+    // What changes meanwhile is one report, and wakes nobody.
+    std::this_thread::sleep_for(reportInterval);
+    lock.lock();
+    changed_.wait(lock, [&] { return ending_ || told != count_; });
+  }
 }
 
-bool LinuxTransactions::send(bool busy) {
-  const std::string_view status = busy ? "STATUS=busy" : "STATUS=idle";
-  const std::string message = std::string(toldReady_ ? "" : "READY=1\n").append(status);
-  return sendto(socket_.get(), message.data(), message.size(), MSG_NOSIGNAL | MSG_DONTWAIT, address_->get(),
-                address_->length) >= 0;
+LinuxTransactions::Report LinuxTransactions::report(bool withReadiness, std::uint64_t count) const {
+  const std::string message = std::string(withReadiness ? "READY=1\n" : "")
+                                  .append("STATUS=")
+                                  .append(std::to_string(count))
+                                  .append(" open transactions");
+  if (sendto(socket_.get(), message.data(), message.size(), MSG_NOSIGNAL | MSG_DONTWAIT, address_->get(),
+             address_->length) >= 0) {
+    return Report::Taken;
+  }
+  return errno == EAGAIN || errno == ENOBUFS || errno == EINTR ? Report::KeptBack : Report::Unheard;
 }
 
 }  // namespace kel::platform

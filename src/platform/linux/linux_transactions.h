@@ -1,9 +1,11 @@
 #pragma once
 
-#include <atomic>
+#include <condition_variable>
 #include <cstdint>
+#include <mutex>
 #include <optional>
 #include <string>
+#include <thread>
 
 #include "platform/linux/owned_descriptor.h"
 #include "platform/linux/unix_address.h"
@@ -17,29 +19,34 @@ class LinuxTransactions final : public Transactions {
   /// `notificationSocket` is the launcher's (NOTIFY_SOCKET): a path, or "@" and an abstract name. Absent or
   /// unusable: nothing is reported.
   explicit LinuxTransactions(const std::optional<std::string>& notificationSocket);
+  LinuxTransactions(const LinuxTransactions&) = delete;
+  LinuxTransactions& operator=(const LinuxTransactions&) = delete;
+  ~LinuxTransactions() override;
 
   void open() override;
   void close() override;
 
-  /// Reports from here on: at once that the process is ready, then every change between idle and busy. Never
-  /// waits; a report that the launcher does not take is made up for by the next one.
+  /// Reports from here on, on a thread of its own: at once that the process is ready, and the count whenever
+  /// it is another than the launcher heard last, a few dozen times a second at most. While the launcher takes
+  /// no more a report is kept back, so that the last one is true; one that nobody listens for is made up for
+  /// by the next. Once.
   void trackActivity();
 
-  std::uint64_t openCount() const { return count_; }
-
  private:
-  void report();
-  bool send(bool busy);
+  enum class Report { Taken, KeptBack, Unheard };
 
+  void reportChanges();
+  Report report(bool withReadiness, std::uint64_t count) const;
+
+  // Fixed after construction.
   std::optional<UnixAddress> address_;
   OwnedDescriptor socket_;
-  std::atomic<std::uint64_t> count_ = 0;
-  std::atomic<bool> tracking_ = false;
-  std::atomic<std::uint64_t> reporters_ = 0;  // calls of `report` that the one at work has not looked after
 
-  // Only in the one `report` at work.
-  bool toldReady_ = false;
-  bool toldBusy_ = false;
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::uint64_t count_ = 0;  // under mutex_
+  bool ending_ = false;      // under mutex_
+  std::thread reporter_;
 };
 
 }  // namespace kel::platform
