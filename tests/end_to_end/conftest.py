@@ -96,12 +96,16 @@ class Home:
         declared = {"QVMessage": "go", "QVMenuItem": {"default": title}}
         (path / "Info.plist").write_bytes(encode({"KTBundleIdentifier": f"org.example.{name}", "QVServices": [declared]}))
 
-    def spawn(self, **streams):
-        return subprocess.Popen([os.environ["KEL_PROGRAM"]], env=self.environment | {"QVRunningFromWarden": "1"}, **streams)
+    def spawn(self, *launcher, **options):
+        variables = self.environment | {"QVRunningFromWarden": "1"}
+        return subprocess.Popen([*launcher, os.environ["KEL_PROGRAM"]], env=variables, **options)
 
     def start(self):
         with open(self.log_path, "ab") as log:
             self.server = self.spawn(stderr=log)
+        self.await_server()
+
+    def await_server(self):
         wait_until(self.connects, "the server")
 
     def connects(self):

@@ -10,6 +10,7 @@
 #include <utility>
 
 #include "platform/linux/files.h"
+#include "platform/linux/linux_process.h"
 
 namespace kel::platform {
 
@@ -62,6 +63,8 @@ void ConduitAcceptor::close() {
 
 void ConduitAcceptor::acceptSome() {
   for (int i = 0; i < acceptsInARow && endpoint_; ++i) {
+    // Where the launcher holds the socket too, the next server finds who still waits in it.
+    if (isTerminating()) return rest();
     OwnedDescriptor socket(accept4(endpoint_->get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
     if (socket) {
       isShort_ = false;

@@ -2,10 +2,12 @@
 
 #include <cerrno>
 #include <csignal>
+#include <poll.h>
 #include <pthread.h>
-#include <semaphore.h>
 #include <stdio.h>
 #include <sys/resource.h>
+#include <sys/signalfd.h>
+#include <system_error>
 #include <unistd.h>
 
 #include "platform/linux/thread.h"
@@ -14,30 +16,17 @@ namespace kel::platform {
 
 namespace {
 
-// The one thing that a signal handler may do to wake a thread. Never destroyed: the signal may come late.
-sem_t& terminationSignals() {
-  static sem_t signals;
+sigset_t terminationSignal() {
+  sigset_t signals;
+  sigemptyset(&signals);
+  sigaddset(&signals, SIGTERM);
   return signals;
-}
-
-void terminationArrived(int) {
-  const int kept = errno;
-  sem_post(&terminationSignals());
-  errno = kept;
-}
-
-void handleSignal(int number, void (*handler)(int)) {
-  struct sigaction action {};
-  action.sa_handler = handler;
-  action.sa_flags = SA_RESTART;
-  sigemptyset(&action.sa_mask);
-  sigaction(number, &action, nullptr);
 }
 
 }  // namespace
 
 LinuxProcess::LinuxProcess() {
-  handleSignal(SIGPIPE, SIG_IGN);
+  std::signal(SIGPIPE, SIG_IGN);
   rlimit descriptors{};
   if (getrlimit(RLIMIT_NOFILE, &descriptors) != 0) return;
   descriptors.rlim_cur = descriptors.rlim_max;
@@ -45,20 +34,20 @@ LinuxProcess::LinuxProcess() {
 }
 
 void LinuxProcess::onTermination(Task handler) {
-  sem_init(&terminationSignals(), 0, 0);
-  startThread("termination", [handler = std::move(handler)] {
+  const sigset_t termination = terminationSignal();
+  pthread_sigmask(SIG_BLOCK, &termination, nullptr);
+  const int arrivals = signalfd(-1, &termination, SFD_CLOEXEC);
+  if (arrivals < 0) throw std::system_error(errno, std::generic_category(), "signalfd");
+  startThread("termination", [handler = std::move(handler), termination, arrivals] {
     for (;;) {
-      while (sem_wait(&terminationSignals()) != 0) {
-      }
+      // Waited for, but left pending while the handler runs: that is how other threads see that it came.
+      pollfd arrival{arrivals, POLLIN, 0};
+      if (poll(&arrival, 1, -1) != 1) continue;
       handler();
+      int number = 0;
+      sigwait(&termination, &number);
     }
   }).detach();
-  handleSignal(SIGTERM, terminationArrived);
-  // A parent may have left the signal blocked; this thread is the one that takes it.
-  sigset_t termination;
-  sigemptyset(&termination);
-  sigaddset(&termination, SIGTERM);
-  pthread_sigmask(SIG_UNBLOCK, &termination, nullptr);
 }
 
 void LinuxProcess::exitNow(int status) {
@@ -71,6 +60,12 @@ void LinuxProcess::exitNow(int status) {
 
 void LinuxProcess::runMainLoop() {
   for (;;) pause();
+}
+
+bool isTerminating() {
+  sigset_t pending;
+  sigemptyset(&pending);
+  return sigpending(&pending) == 0 && sigismember(&pending, SIGTERM) == 1;
 }
 
 }  // namespace kel::platform

@@ -16,7 +16,8 @@ class LinuxProcess final : public Process {
   LinuxProcess(const LinuxProcess&) = delete;
   LinuxProcess& operator=(const LinuxProcess&) = delete;
 
-  /// `handler` runs on a thread of its own that lives as long as the process. Once.
+  /// `handler` runs on a thread of its own that lives as long as the process. Once. Throws std::system_error
+  /// when the process has no descriptor left.
   void onTermination(Task handler) override;
 
   /// What was printed reaches standard output, unless a thread is just printing; nothing else is cleaned up,
@@ -25,5 +26,9 @@ class LinuxProcess final : public Process {
 
   [[noreturn]] void runMainLoop() override;
 };
+
+/// Whether the termination signal has been sent, even if its handler has not had its turn yet. After
+/// `onTermination`, on any thread.
+bool isTerminating();
 
 }  // namespace kel::platform
