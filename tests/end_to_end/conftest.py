@@ -100,9 +100,9 @@ class Home:
         variables = self.environment | {"QVRunningFromWarden": "1"}
         return subprocess.Popen([*launcher, os.environ["KEL_PROGRAM"]], env=variables, **options)
 
-    def start(self):
+    def start(self, **options):
         with open(self.log_path, "ab") as log:
-            self.server = self.spawn(stderr=log)
+            self.server = self.spawn(stderr=log, **options)
         self.await_server()
 
     def await_server(self):
