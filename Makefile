@@ -2,7 +2,7 @@
 SHELL := /bin/bash
 .SHELLFLAGS := -euo pipefail -c
 .DEFAULT_GOAL := build
-.PHONY: build demo test bench fuzz format check-format clean
+.PHONY: build demo test package bench fuzz format check-format clean
 
 NEED := scripts/install-dependencies
 SOURCES = find . -path './build*' -prune -o \( -name '*.h' -o -name '*.cpp' \) -print
@@ -20,6 +20,10 @@ test:
 	@cmake -S . -B build -G Ninja -DKEL_TESTS=ON
 	@cmake --build build
 	@ctest --test-dir build --output-on-failure --no-tests=error -j "$$(nproc)"
+
+package: build
+	@$(NEED) package
+	@cmake --build build --target package
 
 # BENCH_ARGS go to every program, for instance BENCH_ARGS=--benchmark_filter=Cold; BENCH_BUNDLES sets the
 # size of the corpus.
