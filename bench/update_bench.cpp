@@ -8,6 +8,7 @@
 #include <memory>
 #include <string>
 
+#include "common/common.h"
 #include "datastore/data_store.h"
 #include "platform/linux/linux_platform.h"
 
@@ -48,6 +49,11 @@ kel::platform::Platform* platform(benchmark::State& state) {
   }
   static const ScratchHome home{corpus};
   static kel::platform::LinuxPlatform linuxPlatform;
+  static const bool isWatching [[maybe_unused]] = [] {
+    linuxPlatform.watchServiceDirectories(
+        kel::explicit_service_directories(linuxPlatform.platform().directories));
+    return true;
+  }();
   return &linuxPlatform.platform();
 }
 

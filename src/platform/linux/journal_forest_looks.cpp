@@ -42,7 +42,7 @@ void JournalForest::installRecord(JournalNode& node, EntryRecord record, bool is
   const bool isUntold = isDoubted || changesUnseen(before) || changesUnseen(now);
   if (isUntold && !isUnchanged(before, now)) {
     JournalTree::markChanged(node, id);
-    if (uncovered_.contains(&node)) hint(*node.tree);
+    if (isDoubted) hint(*node.tree);
   }
   const bool isSameDirectory = before.leadsToDirectory() && now.leadsToDirectory() &&
                                before.status.kind == now.status.kind &&
@@ -77,6 +77,7 @@ void JournalForest::installListing(DirectoryLook& look, bool isDoubted, EventID 
     node.tree->inode = look.own.inode;
   }
   const EntryStatus before = directory.listing;
+  const EventID latest = node.latest;
   const bool isReplaced =
       before.kind != EntryKind::Unknown &&
       (before.inode != look.own.inode || directory.fileSystem != look.fileSystem.identity);
@@ -86,9 +87,9 @@ void JournalForest::installListing(DirectoryLook& look, bool isDoubted, EventID 
   } else if (isDoubted && before.kind != EntryKind::Unknown && !(before == look.own)) {
     JournalTree::markListed(node, id);
   }
-  const EventID latest = node.latest;
   installNames(look, isDoubted || isChanged, id);
-  if (isDoubted && (isChanged || node.latest != latest) && uncovered_.contains(&node)) hint(*node.tree);
+  const bool wasKnown = isChanged || before.kind != EntryKind::Unknown;
+  if (isDoubted && wasKnown && node.latest != latest) hint(*node.tree);
   directory.listing = look.own;
   directory.listingIsSound = !look.ownIsRacy;
   directory.fileSystem = look.fileSystem.identity;
@@ -113,7 +114,7 @@ void JournalForest::installFailure(DirectoryLook& look, EventID id) {
   if (wasThere || directory.error != look.error || !meansMissing(look.error)) {
     const bool isFirstLook = isMissingRoot && directory.error == 0 && !wasThere;
     if (!isFirstLook) JournalTree::markChanged(node, id);
-    if (directory.error != look.error && uncovered_.contains(&node)) hint(*node.tree);
+    if (!isFirstLook && directory.error != look.error) hint(*node.tree);
   }
   releaseBelow(node);
   directory.listing = {};

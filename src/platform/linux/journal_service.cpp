@@ -16,6 +16,7 @@ constexpr std::chrono::milliseconds betweenGulps{20};
 constexpr std::chrono::seconds shortestPause{30};
 constexpr int pausePerLook = 100;
 
+constexpr std::chrono::seconds beforeFirstLook{1};
 constexpr std::chrono::seconds beforeSaving{2};
 constexpr std::chrono::seconds betweenSavings{60};
 
@@ -110,8 +111,9 @@ void JournalService::open() {
       mountWatch_ = loop.watch(mounts_.descriptor(), EPOLLPRI, [this](std::uint32_t) { readMounts(); });
     }
   }
+  // Whoever started the server waits for a first answer, which needs the processors more.
   isLooking_ = true;
-  look();
+  queue_.after(beforeFirstLook, [this] { look(); });
 }
 
 /// In portions, so that questions are answered in between.

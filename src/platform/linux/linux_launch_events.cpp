@@ -52,7 +52,11 @@ void LinuxLaunchEvents::setHandler(std::string_view stream, SerialQueue& queue,
   if (stream == "com.orvex.beacond.matching") {
     sources_.push_back({queue, seeds_.observe(databaseChange, queue, handler)});
   } else if (stream == "com.orvex.broadcastd.matching") {
-    applications_.seed([&queue, handler] { queue.async(handler); });
+    // Whoever started the server waits for a first answer, which needs the processors more.
+    constexpr std::chrono::seconds pause{1};
+    queue.after(pause, [&applications = applications_, &queue, handler] {
+      applications.seed([&queue, handler] { queue.async(handler); });
+    });
   } else if (stream == "com.orvex.vigil.matching") {
     watch(queue, handler);
   } else {
