@@ -42,10 +42,11 @@ class Listing {
     look_.isListing = true;
     const bool followsLinks = !node.record.isDirectory() || !node.parent;
     // Watched first, listed second: what changes in between is told by the watch.
-    if (settings_.inotify >= 0 && (settings_.mayAddWatches || node.directory->watch >= 0)) {
+    if (settings_.inotify >= 0) {
       const std::uint32_t mask = settings_.watchMask | IN_ONLYDIR | (followsLinks ? 0u : IN_DONT_FOLLOW);
-      look_.watch = inotify_add_watch(settings_.inotify, path.c_str(), mask);
-      look_.watchError = look_.watch < 0 ? errno : 0;
+      const bool mayWatch = settings_.mayAddWatches || node.directory->watch >= 0;
+      if (mayWatch) look_.watch = inotify_add_watch(settings_.inotify, path.c_str(), mask);
+      if (look_.watch < 0) look_.watchError = mayWatch ? errno : ENOSPC;
     }
     taking_.now = timeStampNow();
     const OwnedDescriptor opened = openFile(
