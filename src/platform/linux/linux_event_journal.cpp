@@ -1,5 +1,6 @@
 #include "platform/linux/linux_event_journal.h"
 
+#include <algorithm>
 #include <system_error>
 #include <utility>
 
@@ -34,6 +35,15 @@ LinuxEventJournal::LinuxEventJournal(JournalOptions options, FileSystem& files, 
     : options_(std::move(options)), files_(files), log_(log), pool_(pool) {}
 
 LinuxEventJournal::~LinuxEventJournal() = default;
+
+void LinuxEventJournal::setRoots(std::vector<WatchedRoot> roots) {
+  roots_.clear();
+  for (WatchedRoot& root : roots) {
+    const bool isNew = std::none_of(roots_.begin(), roots_.end(),
+                                    [&root](const WatchedRoot& other) { return other.path == root.path; });
+    if (isNew) roots_.push_back(std::move(root));
+  }
+}
 
 bool LinuxEventJournal::start(ChangeHandler changed) {
   JournalService* const running = service();

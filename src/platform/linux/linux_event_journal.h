@@ -33,8 +33,8 @@ class LinuxEventJournal final : public EventJournal, public ChangeLog {
   /// Writes the index file when it lags behind. No stream and no other call may be left.
   ~LinuxEventJournal() override;
 
-  /// What to watch. Before everything else.
-  void setRoots(std::vector<WatchedRoot> roots) { roots_ = std::move(roots); }
+  /// What to watch; a path that comes again is left out. Before everything else.
+  void setRoots(std::vector<WatchedRoot> roots);
 
   /// Begins to watch, in the background; `changed` is called for what happens from then on. Without this call
   /// the first question begins it. A further call without a handler ends that: none is called once

@@ -21,7 +21,7 @@ class Disk {
   Disk(const Scratch& scratch, unsigned seed)
       : root(scratch / "Services/"), outside_(scratch / "outside/"), random_(seed) {
     fs::create_directories(root);
-    for (int index = 0; index < 4; ++index) {
+    for (unsigned index = 0; index < 4; ++index) {
       makeBundle(root + bundleName(index));
       makeBundle(outside_ + "target" + std::to_string(index));
       makeBundle(outside_ + "spare" + std::to_string(index));
