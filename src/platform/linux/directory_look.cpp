@@ -79,6 +79,7 @@ class Listing {
 
   void keepNames(const JournalDirectory& known, int descriptor) {
     for (const auto& [name, child] : known.children) {
+      if (isLate()) return;
       if (!child->isGone && !child->record.isDirectory()) compareEntry(*child, name.c_str(), descriptor);
     }
   }
@@ -102,6 +103,7 @@ class Listing {
     for (Name& name : names) {
       for (; child != known.children.end() && child->first < name.text; ++child) noteGone(*child->second);
       const bool isKnown = child != known.children.end() && child->first == name.text;
+      if (isLate()) return;
       compareName(isKnown ? (child++)->second.get() : nullptr, name, descriptor);
     }
     for (; child != known.children.end(); ++child) noteGone(*child->second);
@@ -131,6 +133,15 @@ class Listing {
     }
   }
 
+  /// On a slow file system even one directory can take longer than there is time.
+  bool isLate() {
+    constexpr int entriesPerCheck = 64;
+    if (++entries_ % entriesPerCheck == 0) {
+      look_.isLate = look_.isLate || std::chrono::steady_clock::now() > settings_.deadline;
+    }
+    return look_.isLate;
+  }
+
   std::vector<Name> list(int descriptor) {
     std::vector<Name> names;
     alignas(dirent64) std::array<char, 32768> buffer;
@@ -154,6 +165,7 @@ class Listing {
   DirectoryLook& look_;
   const LookSettings& settings_;
   RecordTaking taking_;
+  int entries_ = 0;
 };
 
 }  // namespace
@@ -161,6 +173,8 @@ class Listing {
 DirectoryLook lookAt(JournalNode& node, const std::string& path, const LookSettings& settings) {
   DirectoryLook look;
   look.node = &node;
+  look.isLate = std::chrono::steady_clock::now() > settings.deadline;
+  if (look.isLate) return look;
   if (!node.record.isDirectory()) {
     look.hasRecord = true;
     RecordTaking taking;

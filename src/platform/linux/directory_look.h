@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <map>
 #include <string>
@@ -25,6 +26,8 @@ using KnownFileSystems = std::map<dev_t, FileSystemTraits>;
 /// installed.
 struct DirectoryLook {
   JournalNode* node = nullptr;
+
+  bool isLate = false;  ///< there was no time left for it: nothing else is set
 
   // Of an entry that is no directory, or a link, and was looked at itself.
   bool hasRecord = false;
@@ -53,6 +56,7 @@ struct LookSettings {
   bool alwaysDigest = false;  ///< also where changes are told by watches
   std::size_t mostEntries = 0;
   const KnownFileSystems* fileSystems = nullptr;
+  std::chrono::steady_clock::time_point deadline;
 };
 
 /// Looks at the node at `path`: lists a directory, watching it first, and takes the records of its entries

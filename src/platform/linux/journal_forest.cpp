@@ -66,7 +66,8 @@ void JournalForest::doubtEverything() {
   }
 }
 
-bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode mode) {
+bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode mode,
+                               std::chrono::steady_clock::time_point deadline) {
   constexpr std::size_t batch = 512;
   std::vector<JournalNode*> nodes;
   for (JournalTree* tree : trees) {
@@ -84,6 +85,7 @@ bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode 
   settings.alwaysDigest = !inotify_ || mode == LookMode::ForGood;
   settings.mostEntries = limits_.mostEntries;
   settings.fileSystems = &fileSystems_;
+  settings.deadline = deadline;
   std::vector<DirectoryLook> looks(nodes.size());
   // A share of several nodes is worth the hand-over to another thread.
   constexpr std::size_t share = 16;
@@ -101,14 +103,28 @@ bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode 
   }
 
   const EventID id = newID_();
+  bool isLate = false;
   for (DirectoryLook& look : looks) {
     // What an earlier look of the batch found vanished, or exchanged, is no longer there to be installed.
-    if (!releasedInBatch_.contains(look.node)) install(look, id);
+    if (releasedInBatch_.contains(look.node)) continue;
+    isLate |= look.isLate;
+    if (look.isLate) {
+      enqueue(*look.node, false);
+    } else {
+      install(look, id);
+    }
   }
   releasedInBatch_.clear();
   removeUnusedWatches();
-  return std::any_of(trees.begin(), trees.end(),
-                     [](const JournalTree* tree) { return !tree->isTooLarge && !tree->pending.empty(); });
+  return !isLate && std::any_of(trees.begin(), trees.end(), [](const JournalTree* tree) {
+    return !tree->isTooLarge && !tree->pending.empty();
+  });
+}
+
+bool JournalForest::needsLooks() const {
+  return !uncovered_.empty() || std::any_of(trees_.begin(), trees_.end(), [](const auto& tree) {
+    return !tree->isTooLarge && !tree->pending.empty();
+  });
 }
 
 void JournalForest::enqueue(JournalNode& node, bool isDoubted) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -74,10 +75,13 @@ class JournalForest {
     ForGood  ///< so that the records can be compared with by another process
   };
 
-  /// Looks at some of what is queued in these trees; true when there is more.
-  bool lookAtSome(const std::vector<JournalTree*>& trees, LookMode mode);
+  /// Looks at some of what is queued in these trees, until the deadline; true when there is more and it makes
+  /// sense to go on.
+  bool lookAtSome(const std::vector<JournalTree*>& trees, LookMode mode,
+                  std::chrono::steady_clock::time_point deadline);
 
-  bool hasUncovered() const { return !uncovered_.empty(); }
+  /// True when some change may be found only by looking.
+  bool needsLooks() const;
 
   /// What happened since the last call.
   Hints takeHints() { return std::exchange(hints_, {}); }

@@ -69,7 +69,7 @@ void JournalForest::applyEvent(JournalNode& directory, std::uint32_t mask, std::
 void JournalForest::noteNames(JournalNode& directory, EventID id) {
   JournalTree::markListed(directory, id);
   unsettled_.insert(&directory);
-  if (directory.tree->vanishedCount > limits_.mostVanished) directory.tree->forgetVanished(id);
+  enforceLimits(directory);
 }
 
 void JournalForest::noteDisappearance(JournalNode& directory, std::string_view name, bool wasMoved,
@@ -96,6 +96,8 @@ void JournalForest::noteAttributes(JournalNode& directory, EventID id) {
 
 void JournalForest::noteAppearance(JournalNode& directory, std::string_view name, bool isDirectory,
                                    EventID id) {
+  // What is not noted is found when there is room again.
+  if (directory.tree->isTooLarge) return enqueue(directory, true);
   const auto known = directory.directory->children.find(name);
   if (known != directory.directory->children.end()) {
     release(*known->second);

@@ -10,6 +10,7 @@ namespace kel::platform {
 
 namespace {
 
+using Clock = std::chrono::steady_clock;
 using LookMode = JournalForest::LookMode;
 
 constexpr std::string_view positionFormat = "kel journal position 1";
@@ -73,16 +74,19 @@ EventID JournalKeeper::currentEventID() {
   return id;
 }
 
-bool JournalKeeper::settle(const std::vector<JournalTree*>& trees) {
-  const auto deadline = std::chrono::steady_clock::now() + options_.longestLook;
+void JournalKeeper::settle(const std::vector<JournalTree*>& trees) {
+  // An update asks several questions one after the other, and waits for all of them together.
+  constexpr int questionsTogether = 4;
+  constexpr int shareOfFurtherOnes = 25;
+  const auto start = Clock::now();
+  const bool wasLate = lastLate_ && start - *lastLate_ < questionsTogether * options_.longestLook;
+  const auto deadline = start + options_.longestLook / (wasLate ? shareOfFurtherOnes : 1);
   forest_.readEvents();
   forest_.questionUncovered(trees);
-  bool isLeft = true;
-  while ((isLeft = forest_.lookAtSome(trees, LookMode::InParallel)) &&
-         std::chrono::steady_clock::now() < deadline) {
+  while (forest_.lookAtSome(trees, LookMode::InParallel, deadline)) {
   }
+  if (!wasLate && Clock::now() > deadline) lastLate_ = Clock::now();
   noteHorizons();
-  return !isLeft;
 }
 
 void JournalKeeper::noteHorizons() {
@@ -116,7 +120,8 @@ std::vector<JournalEvent> JournalKeeper::eventsSince(EventID since, const std::v
 
 bool JournalKeeper::lookInBackground() {
   forest_.readEvents();
-  const bool isLeft = forest_.lookAtSome(allTrees(), LookMode::InBackground);
+  const bool isLeft =
+      forest_.lookAtSome(allTrees(), LookMode::InBackground, Clock::now() + std::chrono::seconds(1));
   noteHorizons();
   return isLeft;
 }
@@ -124,8 +129,7 @@ bool JournalKeeper::lookInBackground() {
 Bytes JournalKeeper::indexFile() {
   forest_.readEvents();
   forest_.questionUnsettled();
-  const auto deadline = std::chrono::steady_clock::now() + options_.longestLook;
-  while (forest_.lookAtSome(allTrees(), LookMode::ForGood) && std::chrono::steady_clock::now() < deadline) {
+  while (forest_.lookAtSome(allTrees(), LookMode::ForGood, Clock::now() + std::chrono::seconds(1))) {
   }
   noteHorizons();
   // A record must not be newer than the events that are kept with it.

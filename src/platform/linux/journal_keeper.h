@@ -42,7 +42,8 @@ class JournalKeeper {
   std::vector<JournalEvent> eventsSince(EventID since, const std::vector<std::string>& paths,
                                         bool watchesRoot);
 
-  /// Looks at some of what is queued, for a few milliseconds; true when there is more.
+  /// Looks at some of what is queued, for some milliseconds, a second at most; true when it makes sense to go
+  /// on.
   bool lookInBackground();
 
   /// Queues what is uncovered to be looked at in the background.
@@ -59,7 +60,7 @@ class JournalKeeper {
  private:
   EventID newID();
   void reserve(EventID id);
-  bool settle(const std::vector<JournalTree*>& trees);
+  void settle(const std::vector<JournalTree*>& trees);
   void noteHorizons();
   std::vector<JournalTree*> allTrees() const;
   JournalTree* treeOf(const std::string& path) const;
@@ -75,6 +76,7 @@ class JournalKeeper {
   EventID reservedID_ = 0;  ///< a later process starts behind it
   EventID savedEvent_ = 0;
   bool failureReported_ = false;
+  std::optional<std::chrono::steady_clock::time_point> lastLate_;  // when time last ran out
   JournalForest forest_;
 };
 

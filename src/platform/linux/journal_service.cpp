@@ -94,6 +94,7 @@ void JournalService::subscribe(std::shared_ptr<JournalSubscription> subscription
         keeper_.eventsSince(subscription->position(), subscription->paths(), subscription->watchesRoot());
     events.push_back({{}, event_flags::historyDone, keeper_.lastID()});
     if (JournalSubscription::deliver(subscription, std::move(events), keeper_.lastID())) {
+      std::erase_if(subscriptions_, [](const auto& entry) { return entry.expired(); });
       subscriptions_.push_back(subscription);
     }
     finishRound();
@@ -134,7 +135,7 @@ void JournalService::look() {
 }
 
 void JournalService::scheduleLook() {
-  if (isLooking_ || !keeper_.forest().hasUncovered() || keeper_.forest().eventDescriptor() < 0) return;
+  if (isLooking_ || !keeper_.forest().needsLooks() || keeper_.forest().eventDescriptor() < 0) return;
   isLooking_ = true;
   queue_.after(std::max<Clock::duration>(shortestPause, pausePerLook * lastLook_), [this] { look(); });
 }

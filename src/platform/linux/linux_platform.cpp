@@ -1,6 +1,11 @@
 #include "platform/linux/linux_platform.h"
 
+#include <algorithm>
+#include <charconv>
+#include <fcntl.h>
 #include <utility>
+
+#include "platform/linux/files.h"
 
 namespace kel::platform {
 
@@ -13,6 +18,12 @@ std::string recordDirectory(const RuntimeDirectory& runtime) {
 
 JournalOptions journalOptions(const std::optional<std::string>& stateDirectory) {
   JournalOptions options;
+  // Half of what the user may watch is left to the user's other programs.
+  const auto most = readSmallFile(AT_FDCWD, "/proc/sys/fs/inotify/max_user_watches");
+  std::size_t mostOfUser = 0;
+  if (most && std::from_chars(most->data(), most->data() + most->size(), mostOfUser).ec == std::errc()) {
+    options.limits.mostWatches = std::min(options.limits.mostWatches, mostOfUser / 2);
+  }
   if (stateDirectory) options.directory = joinPath(*stateDirectory, "kel");
   return options;
 }

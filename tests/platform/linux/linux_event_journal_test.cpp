@@ -170,6 +170,10 @@ TEST_P(EventJournalTest, BeyondTheLimitsTheTruthIsFoundByLooking) {
   restart();
   options.limits.mostEntries = 100;
   EXPECT_THAT(replay(start), ElementsAre(mustScan));
+  restart();
+  options.limits.mostEntries = 100'000;
+  options.longestLook = std::chrono::milliseconds(0);
+  EXPECT_THAT(replay(start), ElementsAre(mustScan));
 }
 
 class LiveEventJournalTest : public EventJournalTest {};
