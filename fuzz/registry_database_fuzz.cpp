@@ -1,29 +1,15 @@
-// The application database: what is read must be what the writer writes. The input is taken as a whole file
-// and as a payload, whose digest is made to fit.
-
-#include <algorithm>
-#include <cstddef>
-#include <cstdint>
-#include <cstdlib>
-
 #include "platform/linux/application_database.h"
-
-namespace {
-
-using namespace kel::platform;
-
-void check(BytesView bytes) {
-  const ApplicationDatabaseReading reading = decodeApplications(bytes);
-  if (reading.applications.has_value() == !reading.error.empty()) std::abort();
-  if (!reading.applications) return;
-  const auto written = encodeApplications(*reading.applications);
-  if (!written || !std::ranges::equal(*written, bytes)) std::abort();
-}
-
-}  // namespace
+#include "sealed_check.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  check({data, size});
-  check(sealApplicationDatabase({data, size}));
+  using namespace kel::platform;
+  const auto rewrite = [](BytesView file) -> std::optional<Bytes> {
+    const auto applications = decodeApplications(file);
+    if (!applications) return std::nullopt;
+    auto written = encodeApplications(*applications);
+    if (!written || decodeApplications(*written) != applications) std::abort();
+    return written;
+  };
+  checkRewriting({data, size}, applicationDatabaseFormat, rewrite);
   return 0;
 }

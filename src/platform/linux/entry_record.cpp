@@ -9,6 +9,7 @@
 #include <sys/sysmacros.h>
 
 #include "platform/linux/files.h"
+#include "platform/linux/sealed_bytes.h"
 
 namespace kel::platform {
 
@@ -31,7 +32,9 @@ EntryStatus look(int directory, const char* name, int flags, dev_t* device = nul
     return status;
   }
   const auto nanoseconds = [](const statx_timestamp& time) {
-    return static_cast<std::int64_t>(time.tv_sec) * nanosecondsPerSecond + time.tv_nsec;
+    // Wraps around in the far future, which anyone may give a file.
+    return static_cast<std::int64_t>(static_cast<std::uint64_t>(time.tv_sec) * nanosecondsPerSecond +
+                                     time.tv_nsec);
   };
   status.kind = kindOf(found.stx_mode);
   status.hasOtherNames = status.kind == EntryKind::File && found.stx_nlink > 1;
@@ -62,6 +65,8 @@ std::optional<Digest> digestOf(int directory, const char* name, const EntryRecor
   return md5(bytes);
 }
 
+}  // namespace
+
 EntryRecord lookAtEntry(int directory, const char* name) {
   EntryRecord record;
   record.isKnown = true;
@@ -73,8 +78,6 @@ EntryRecord lookAtEntry(int directory, const char* name) {
   }
   return record;
 }
-
-}  // namespace
 
 std::int64_t timeStampNow() {
   timespec now{};
@@ -123,5 +126,26 @@ bool isUnchanged(const EntryRecord& before, const EntryRecord& now) {
 bool changesUnseen(const EntryRecord& record) { return record.isLink() || record.status.hasOtherNames; }
 
 EntryStatus statusOf(int descriptor, dev_t& device) { return look(descriptor, "", AT_EMPTY_PATH, &device); }
+
+void writeStatus(ByteWriter& writer, const EntryStatus& status) {
+  writer.number(static_cast<unsigned>(status.kind) << 1 | (status.hasOtherNames ? 1u : 0u));
+  writer.number(status.inode);
+  writer.fixed(static_cast<std::uint64_t>(status.changed));
+  writer.fixed(static_cast<std::uint64_t>(status.modified));
+  writer.number(status.size);
+}
+
+EntryStatus readStatus(ByteReader& reader) {
+  EntryStatus status;
+  const std::uint64_t kind = reader.number();
+  if (kind >> 1 > static_cast<unsigned>(EntryKind::Other)) reader.fail();
+  status.kind = reader.failed() ? EntryKind::Unknown : static_cast<EntryKind>(kind >> 1);
+  status.hasOtherNames = (kind & 1) != 0;
+  status.inode = reader.number();
+  status.changed = static_cast<std::int64_t>(reader.fixed());
+  status.modified = static_cast<std::int64_t>(reader.fixed());
+  status.size = reader.number();
+  return status;
+}
 
 }  // namespace kel::platform

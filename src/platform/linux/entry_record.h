@@ -8,6 +8,9 @@
 
 namespace kel::platform {
 
+class ByteReader;
+class ByteWriter;
+
 enum class EntryKind : std::uint8_t { Unknown, File, Directory, Link, Other };
 
 /// What the kernel says about an entry. Times are nanoseconds since the epoch and are only ever compared for
@@ -37,6 +40,9 @@ struct EntryRecord {
 
   bool operator==(const EntryRecord&) const = default;
 };
+
+/// Looks at `name` in `directory`: at a link and at what it leads to. Of a directory only kind and inode.
+EntryRecord lookAtEntry(int directory, const char* name);
 
 /// How far the times of a file system can be trusted.
 enum class TimeStamps : std::uint8_t {
@@ -73,5 +79,9 @@ bool isUnchanged(const EntryRecord& before, const EntryRecord& now);
 
 /// The status of an open file or directory; of unknown kind when it cannot be had. `device` is set with it.
 EntryStatus statusOf(int descriptor, dev_t& device);
+
+/// How a status lies in files. What is no status fails the reader.
+void writeStatus(ByteWriter& writer, const EntryStatus& status);
+EntryStatus readStatus(ByteReader& reader);
 
 }  // namespace kel::platform

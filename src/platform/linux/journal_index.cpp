@@ -23,27 +23,6 @@ enum Flag : unsigned {
   isSound = 0x10,
 };
 
-void writeStatus(ByteWriter& writer, const EntryStatus& status) {
-  writer.number(static_cast<unsigned>(status.kind) << 1 | (status.hasOtherNames ? 1u : 0u));
-  writer.number(status.inode);
-  writer.fixed(static_cast<std::uint64_t>(status.changed));
-  writer.fixed(static_cast<std::uint64_t>(status.modified));
-  writer.number(status.size);
-}
-
-EntryStatus readStatus(ByteReader& reader) {
-  EntryStatus status;
-  const std::uint64_t kind = reader.number();
-  if (kind >> 1 > static_cast<unsigned>(EntryKind::Other)) reader.fail();
-  status.kind = reader.failed() ? EntryKind::Unknown : static_cast<EntryKind>(kind >> 1);
-  status.hasOtherNames = (kind & 1) != 0;
-  status.inode = reader.number();
-  status.changed = static_cast<std::int64_t>(reader.fixed());
-  status.modified = static_cast<std::int64_t>(reader.fixed());
-  status.size = reader.number();
-  return status;
-}
-
 class TreeWriter {
  public:
   TreeWriter(ByteWriter& writer, EventID horizon) : writer_(writer), horizon_(horizon) {}

@@ -1,9 +1,9 @@
 #include "platform/linux/linux_application_registry.h"
 
 #include <algorithm>
-#include <time.h>
 #include <utility>
 
+#include "platform/linux/application_information.h"
 #include "platform/linux/files.h"
 
 namespace kel::platform {
@@ -97,24 +97,22 @@ ApplicationWalk LinuxApplicationRegistry::walkRoots() {
 }
 
 LinuxApplicationRegistry::Outsider LinuxApplicationRegistry::Outsider::at(const std::string& path) {
-  return {path, platform::isDirectory(path), informationStatus(path).identity};
+  return {path, platform::isDirectory(path), informationStatus(path).status};
 }
 
 LinuxApplicationRegistry::Look LinuxApplicationRegistry::lookAt(const std::string& application) const {
   const InformationStatus before = informationStatus(application);
   const auto known = memory_->find(application);
-  if (before.isKnown && known != memory_->end() && known->second.information == before.identity)
+  if (before.isKnown && known != memory_->end() && known->second.information == before.status)
     return {known->second, true, before.isLink};
 
-  Look look{{before.identity, 0}, before.isKnown, before.isLink};
-  if (!before.identity) return look;
-  timespec now{};
-  clock_gettime(CLOCK_REALTIME_COARSE, &now);
-  look.isSettled = !isRacy(before.changeTime, now);
-  if (!before.isReadable) return look;
+  Look look{{before.status, 0}, before.isKnown, before.isLink};
+  if (!before.exists()) return look;
+  look.isSettled = !isRacy(before.status.changed, timeStampNow(), TimeStamps::Local);
+  if (before.status.kind != EntryKind::File || before.status.size > largestForeignFile) return look;
   const FileReading file = files_.read(informationPath(application), largestForeignFile);
   look.application.flags = file.bytes ? informationFlags(*file.bytes) : 0;
-  look.isSettled = look.isSettled && file.bytes && informationStatus(application).identity == before.identity;
+  look.isSettled = look.isSettled && file.bytes && informationStatus(application).status == before.status;
   return look;
 }
 
@@ -131,17 +129,18 @@ void LinuxApplicationRegistry::remember(RememberedApplications settled) {
 }
 
 void LinuxApplicationRegistry::loadDatabase() {
-  ApplicationDatabaseReading reading{RememberedApplications(), {}};
+  std::optional<RememberedApplications> loaded(std::in_place);
   if (database_ && files_.exists(*database_)) {
     const FileReading file = files_.read(*database_, largestApplicationDatabase);
-    reading =
-        file.bytes ? decodeApplications(*file.bytes) : ApplicationDatabaseReading{std::nullopt, file.error};
+    loaded = file.bytes ? decodeApplications(*file.bytes) : std::nullopt;
+    if (!loaded) {
+      log_.write("Ignoring the application database " + *database_ + ": " +
+                 (file.bytes ? "damaged or of another version" : file.error));
+    }
   }
-  databaseIsUnusable_ = !reading.applications;
-  if (databaseIsUnusable_)
-    log_.write("Ignoring the application database " + *database_ + ": " + reading.error);
-  memory_ = std::make_shared<const RememberedApplications>(
-      std::move(reading.applications).value_or(RememberedApplications()));
+  databaseIsUnusable_ = !loaded;
+  memory_ =
+      std::make_shared<const RememberedApplications>(std::move(loaded).value_or(RememberedApplications()));
 }
 
 void LinuxApplicationRegistry::writeDatabase() {

@@ -59,7 +59,7 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
   struct Outsider {
     std::string path;
     bool isDirectory = false;
-    std::optional<FileIdentity> information;
+    EntryStatus information;
 
     static Outsider at(const std::string& path);
     bool operator==(const Outsider&) const = default;
@@ -68,7 +68,7 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
   /// What one look at an application tells.
   struct Look {
     RememberedApplication application;
-    bool isSettled = false;  ///< any later change shows in the identity
+    bool isSettled = false;  ///< any later change shows in the status
     bool isLink = false;     ///< the information dictionary lies somewhere else
   };
 
