@@ -10,8 +10,6 @@ namespace kel::platform {
 
 namespace {
 
-constexpr std::string_view indexFormat = "kel journal index 1";
-
 // A path is at most 4096 bytes long, so no directory that can be reached lies deeper.
 constexpr int deepest = 2048;
 
@@ -75,7 +73,9 @@ class TreeReader {
     }
     const EventID changed = readID();
     const bool leadsToDirectory = record.leadsToDirectory();
-    if (depth > deepest || (!node.parent && !leadsToDirectory)) return reader_.fail();
+    // A root is a directory, also while it is missing.
+    const bool isPossible = node.parent || (record.isDirectory() && (flags & isGone) == 0);
+    if (depth > deepest || !isPossible) return reader_.fail();
     node.record = std::move(record);
     node.isBoundless = (flags & isBoundless) != 0;
     if (flags & isGone) {

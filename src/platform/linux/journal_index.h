@@ -18,6 +18,8 @@ struct JournalIndex {
   std::vector<std::unique_ptr<JournalTree>> trees;
 };
 
+inline constexpr std::string_view indexFormat = "kel journal index 1";
+
 /// The bytes of the index file. A tree that was never seen whole is left out: what changes in it cannot be
 /// told from that. Events before a tree's horizon are left out as well.
 Bytes encodeIndex(EventID lastID, const std::vector<std::unique_ptr<JournalTree>>& trees);
