@@ -1,6 +1,5 @@
 #include "platform/linux/notification_store.h"
 
-#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <fcntl.h>
@@ -10,31 +9,20 @@
 #include <thread>
 #include <unistd.h>
 
-#include "platform/digest.h"
 #include "platform/file_system.h"
 #include "platform/linux/files.h"
+#include "platform/linux/sealed_bytes.h"
 
 namespace kel::platform {
 
 namespace {
 
-constexpr std::string_view mark = "KELSEED1";
-constexpr std::size_t digestOffset = 24;
-constexpr std::size_t recordSize = digestOffset + std::tuple_size_v<Digest>;
+constexpr std::string_view recordFormat = "kel notification 1";
+constexpr std::size_t largestRecord = 64;
 
 // Neither can be the file of a name: those never begin with a dot.
 constexpr const char* lockName = ".lock";
 constexpr const char* newRecordName = ".new";
-
-void appendNumber(Bytes& bytes, std::uint64_t number) {
-  for (int shift = 0; shift < 64; shift += 8) bytes.push_back(static_cast<std::uint8_t>(number >> shift));
-}
-
-std::uint64_t numberAt(BytesView bytes, std::size_t offset) {
-  std::uint64_t number = 0;
-  for (std::size_t i = 8; i-- > 0;) number = number << 8 | bytes[offset + i];
-  return number;
-}
 
 OwnedDescriptor openDirectory(const std::string& path) {
   OwnedDescriptor directory = openFile(AT_FDCWD, path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
@@ -46,12 +34,14 @@ OwnedDescriptor openDirectory(const std::string& path) {
 }
 
 std::optional<NotificationRecord> readRecord(int directory, const std::string& file) {
-  const auto text = readSmallFile(directory, file, recordSize);
-  if (!text) return std::nullopt;
-  const auto record =
-      decodeNotificationRecord({reinterpret_cast<const std::uint8_t*>(text->data()), text->size()});
-  if (!record) errno = EBADMSG;
-  return record;
+  const auto bytes = readFile(directory, file, largestRecord);
+  if (!bytes) return std::nullopt;
+  auto reader = ByteReader::open(*bytes, recordFormat);
+  NotificationRecord record;
+  if (reader) record = {reader->fixed(), reader->fixed()};
+  if (reader && reader->atEnd()) return record;
+  errno = EBADMSG;
+  return std::nullopt;
 }
 
 /// Holders keep the lock for microseconds; one that does not let go must not stop the caller.
@@ -71,27 +61,14 @@ bool lockInTime(int lock) {
 bool replaceRecord(int directory, const std::string& file, const NotificationRecord& record) {
   const OwnedDescriptor fresh =
       openFile(directory, newRecordName, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK, 0600);
-  return fresh && writeWhole(fresh.get(), encodeNotificationRecord(record)) &&
+  ByteWriter writer;
+  writer.fixed(record.state);
+  writer.fixed(record.posts);
+  return fresh && writeWhole(fresh.get(), writer.sealed(recordFormat)) &&
          renameat(directory, newRecordName, directory, file.c_str()) == 0;
 }
 
 }  // namespace
-
-Bytes encodeNotificationRecord(const NotificationRecord& record) {
-  Bytes bytes(mark.begin(), mark.end());
-  appendNumber(bytes, record.state);
-  appendNumber(bytes, record.posts);
-  const Digest digest = md5(bytes);
-  bytes.insert(bytes.end(), digest.begin(), digest.end());
-  return bytes;
-}
-
-std::optional<NotificationRecord> decodeNotificationRecord(BytesView bytes) {
-  if (bytes.size() != recordSize || !std::equal(mark.begin(), mark.end(), bytes.begin())) return std::nullopt;
-  const Digest digest = md5(bytes.first(digestOffset));
-  if (!std::equal(digest.begin(), digest.end(), bytes.begin() + digestOffset)) return std::nullopt;
-  return NotificationRecord{numberAt(bytes, 8), numberAt(bytes, 16)};
-}
 
 std::optional<std::string> notificationFileName(std::string_view name) {
   constexpr std::size_t longest = 200;

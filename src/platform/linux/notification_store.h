@@ -6,23 +6,13 @@
 #include <string>
 #include <string_view>
 
-#include "platform/bytes.h"
-
 namespace kel::platform {
 
 /// What is kept for one notification name.
 struct NotificationRecord {
   std::uint64_t state = 0;
   std::uint64_t posts = 0;  ///< goes up by one for every post; 0: never posted
-
-  bool operator==(const NotificationRecord&) const = default;
 };
-
-/// The stored form: a mark, state and posts in little-endian order, and the MD5 digest of all of it.
-Bytes encodeNotificationRecord(const NotificationRecord& record);
-
-/// Absent for anything but a whole, undamaged record.
-std::optional<NotificationRecord> decodeNotificationRecord(BytesView bytes);
 
 /// The file name for a notification name: letters, digits, "_", "-" and "." (but at the start) stand for
 /// themselves, other bytes are "%" and two hexadecimal digits. Absent when that is empty or over 200 bytes.
