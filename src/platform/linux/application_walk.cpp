@@ -48,10 +48,11 @@ class Walker {
       if (type == S_IFDIR && !isApplication) subfolders.push_back(joinPath(folder, name));
       if (type == S_IFDIR && isApplication) found.push_back({joinPath(folder, name), false});
       if (type != S_IFLNK || !isApplication) continue;
-      if (leadsToDirectory(dirfd(listing.get()), entry->d_name)) {
-        found.push_back({joinPath(folder, name), true});
+      std::string path = joinPath(folder, name);
+      if (isDirectory(path)) {
+        found.push_back({std::move(path), true});
       } else {
-        deadLinks.push_back(joinPath(folder, name));
+        deadLinks.push_back(std::move(path));
       }
     }
     std::ranges::move(found, std::back_inserter(result_.applications));
@@ -72,11 +73,6 @@ class Walker {
     if (entry.d_type != DT_UNKNOWN) return static_cast<mode_t>(DTTOIF(entry.d_type));
     struct stat status {};
     return fstatat(folder, entry.d_name, &status, AT_SYMLINK_NOFOLLOW) == 0 ? status.st_mode & S_IFMT : 0;
-  }
-
-  static bool leadsToDirectory(int folder, const char* name) {
-    struct stat status {};
-    return fstatat(folder, name, &status, 0) == 0 && S_ISDIR(status.st_mode);
   }
 
   ApplicationWalk result_;

@@ -57,8 +57,7 @@ EndpointSocket::~EndpointSocket() {
 }
 
 EndpointBinding bindEndpoint(const std::string& path) {
-  OwnedDescriptor lock(
-      open((path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0600));
+  OwnedDescriptor lock = openFile(AT_FDCWD, path + ".lock", O_RDWR | O_CREAT | O_NOFOLLOW | O_NONBLOCK, 0600);
   if (!lock) return failed(path + ".lock");
   while (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
     if (errno == EWOULDBLOCK) return servedElsewhere(path);

@@ -18,11 +18,14 @@ std::string errorLine(const std::string& path, int errorNumber) {
   return path + ": " + errorText(errorNumber);
 }
 
+bool isWhole(const std::string& path) {
+  if (path.find('\0') == std::string::npos) return true;
+  errno = EINVAL;
+  return false;
+}
+
 OwnedDescriptor openFile(int directory, const std::string& path, int flags, mode_t mode) {
-  if (path.find('\0') != std::string::npos) {
-    errno = EINVAL;
-    return {};
-  }
+  if (!isWhole(path)) return {};
   for (;;) {
     OwnedDescriptor file(openat(directory, path.c_str(), flags | O_CLOEXEC, mode));
     if (file || errno != EINTR) return file;
@@ -76,16 +79,11 @@ std::optional<std::string> readSmallFile(int directory, const std::string& path,
 }
 
 DirectoryListing openListing(const std::string& path) {
-  if (path.find('\0') == std::string::npos) return DirectoryListing(opendir(path.c_str()));
-  errno = EINVAL;
-  return nullptr;
+  return DirectoryListing(isWhole(path) ? opendir(path.c_str()) : nullptr);
 }
 
 bool makeDirectories(const std::string& path) {
-  if (path.find('\0') != std::string::npos) {
-    errno = EINVAL;
-    return false;
-  }
+  if (!isWhole(path)) return false;
   if (isDirectory(path)) return true;
   for (std::size_t end = path.find('/', 1); end != std::string::npos; end = path.find('/', end + 1)) {
     if (mkdir(path.substr(0, end).c_str(), 0700) != 0 && errno != EEXIST) return false;
@@ -97,9 +95,8 @@ bool makeDirectories(const std::string& path) {
 
 bool isDirectory(const std::string& path) {
   struct stat status {};
-  if (path.find('\0') != std::string::npos) return false;
   const int kept = errno;
-  const bool found = stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
+  const bool found = isWhole(path) && stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
   errno = kept;
   return found;
 }

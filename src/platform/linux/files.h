@@ -21,8 +21,11 @@ std::string errorText(int errorNumber);
 /// "PATH: TEXT", one line for one failed operation.
 std::string errorLine(const std::string& path, int errorNumber);
 
-/// `openat` of a path relative to `directory` (AT_FDCWD for the working directory), closed on exec. A path
-/// that holds a NUL fails with EINVAL: the kernel would see a shorter one.
+/// False, with EINVAL, for a path that holds a NUL: the kernel would see a shorter one.
+bool isWhole(const std::string& path);
+
+/// `openat` of a path relative to `directory` (AT_FDCWD for the working directory), closed on exec. Fails
+/// when it is not whole.
 OwnedDescriptor openFile(int directory, const std::string& path, int flags, mode_t mode = 0);
 
 /// Writes all of `bytes`, however often the kernel takes only a part.
@@ -47,7 +50,7 @@ struct CloseDirectory {
 /// The entries of a directory, to be had with `readdir`; null when it cannot be read.
 using DirectoryListing = std::unique_ptr<DIR, CloseDirectory>;
 
-/// Lists `path`; one that holds a NUL fails with EINVAL.
+/// Lists `path`; fails when it is not whole.
 DirectoryListing openListing(const std::string& path);
 
 /// Makes `path` and its missing parents, mode 0700.

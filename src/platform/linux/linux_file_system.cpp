@@ -82,7 +82,7 @@ std::optional<std::vector<std::string>> LinuxFileSystem::listDirectory(const std
 
 bool LinuxFileSystem::exists(const std::string& path) {
   struct stat status {};
-  return path.find('\0') == std::string::npos && stat(path.c_str(), &status) == 0;
+  return isWhole(path) && stat(path.c_str(), &status) == 0;
 }
 
 FileReading LinuxFileSystem::read(const std::string& path, std::size_t largest) {
@@ -95,7 +95,7 @@ std::optional<std::string> LinuxFileSystem::writeAtomically(const std::string& p
   const std::size_t slash = path.rfind('/');
   const std::string parent =
       slash == std::string::npos ? "." : path.substr(0, std::max<std::size_t>(slash, 1));
-  if (path.find('\0') != std::string::npos || slash + 1 == path.size()) return errorLine(path, EINVAL);
+  if (!isWhole(path) || slash + 1 == path.size()) return errorLine(path, EINVAL);
   if (!makeDirectories(parent)) return errorLine(parent, errno);
   const OwnedDescriptor directory = openFile(AT_FDCWD, parent, O_RDONLY | O_DIRECTORY);
   if (!directory) return errorLine(parent, errno);
@@ -117,8 +117,6 @@ std::optional<std::string> LinuxFileSystem::writePlainly(const std::string& path
   return std::nullopt;
 }
 
-bool LinuxFileSystem::remove(const std::string& path) {
-  return path.find('\0') == std::string::npos && unlink(path.c_str()) == 0;
-}
+bool LinuxFileSystem::remove(const std::string& path) { return isWhole(path) && unlink(path.c_str()) == 0; }
 
 }  // namespace kel::platform
