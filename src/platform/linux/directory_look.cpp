@@ -49,6 +49,7 @@ class Listing {
       if (look_.watch < 0) look_.watchError = mayWatch ? errno : ENOSPC;
     }
     taking_.now = timeStampNow();
+    taking_.deadline = settings_.deadline;
     const OwnedDescriptor opened = openFile(
         AT_FDCWD, path, O_RDONLY | O_DIRECTORY | O_NONBLOCK | O_NOCTTY | (followsLinks ? 0 : O_NOFOLLOW));
     if (!opened) {
@@ -56,7 +57,7 @@ class Listing {
       return;
     }
     look_.own = statusOf(opened.get(), look_.device);
-    findFileSystem(opened.get());
+    look_.fileSystem = traitsOf(opened.get());
     taking_.stamps = look_.fileSystem.notifies ? TimeStamps::Local : TimeStamps::Foreign;
     // Where a watch tells of the next change, telling it from the record is not worth a reading.
     taking_.digestIfRacy = settings_.alwaysDigest || look_.watch < 0 || !look_.fileSystem.notifies ||
@@ -72,11 +73,6 @@ class Listing {
   }
 
  private:
-  void findFileSystem(int descriptor) {
-    const auto known = settings_.fileSystems->find(look_.device);
-    look_.fileSystem = known != settings_.fileSystems->end() ? known->second : traitsOf(descriptor);
-  }
-
   void keepNames(const JournalDirectory& known, int descriptor) {
     for (const auto& [name, child] : known.children) {
       if (isLate()) return;
@@ -179,6 +175,7 @@ DirectoryLook lookAt(JournalNode& node, const std::string& path, const LookSetti
     look.hasRecord = true;
     RecordTaking taking;
     taking.now = timeStampNow();
+    taking.deadline = settings.deadline;
     const bool notifies = node.parent && node.parent->directory->notifies;
     taking.stamps = notifies ? TimeStamps::Local : TimeStamps::Foreign;
     taking.digestIfRacy = settings.alwaysDigest || !notifies;

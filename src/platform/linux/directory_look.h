@@ -2,7 +2,6 @@
 
 #include <chrono>
 #include <cstddef>
-#include <map>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -18,9 +17,6 @@ struct FileSystemTraits {
   std::uint64_t identity = 0;
   bool notifies = false;
 };
-
-/// By device; looks read it and bring what they had to ask.
-using KnownFileSystems = std::map<dev_t, FileSystemTraits>;
 
 /// What a look at a node found, compared with what is remembered. Nothing but these differences needs to be
 /// installed.
@@ -55,8 +51,7 @@ struct LookSettings {
   bool mayAddWatches = true;  ///< else only directories that have one are watched again
   bool alwaysDigest = false;  ///< also where changes are told by watches
   std::size_t mostEntries = 0;
-  const KnownFileSystems* fileSystems = nullptr;
-  std::chrono::steady_clock::time_point deadline;
+  std::chrono::steady_clock::time_point deadline = std::chrono::steady_clock::time_point::max();
 };
 
 /// Looks at the node at `path`: lists a directory, watching it first, and takes the records of its entries

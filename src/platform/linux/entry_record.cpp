@@ -108,6 +108,7 @@ EntryRecord takeRecord(int directory, const char* name, const EntryRecord* befor
     record.isRacy = racy(record.status) || racy(record.target);
     const bool isWanted = record.isRacy && (taking.digestIfRacy || changesUnseen(record));
     if (!isWanted && !(before && before->digest)) return record;
+    if (std::chrono::steady_clock::now() > taking.deadline) return record;
     record.digest = digestOf(directory, name, record);
     // Only when nothing changed around the reading do the two belong together.
     const EntryRecord after = lookAtEntry(directory, name);

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <optional>
 #include <sys/types.h>
@@ -62,11 +63,12 @@ struct RecordTaking {
   std::int64_t now = 0;  ///< `timeStampNow`, from before the look
   TimeStamps stamps = TimeStamps::Local;
   bool digestIfRacy = true;  ///< also of what a watch tells the changes of
+  std::chrono::steady_clock::time_point deadline = std::chrono::steady_clock::time_point::max();
 };
 
 /// Looks at `name` in `directory`, at a link and at what it leads to. `before` is the last record, absent for
 /// a new entry: one with a digest gets a digest again, so that the two can be compared. Never waits for a
-/// FIFO or a device and reads at most 1 MiB.
+/// FIFO or a device and reads at most 1 MiB, and nothing after the deadline.
 EntryRecord takeRecord(int directory, const char* name, const EntryRecord* before,
                        const RecordTaking& taking);
 

@@ -1,6 +1,7 @@
 #include "platform/linux/journal_forest.h"
 
 #include <algorithm>
+#include <atomic>
 #include <sys/inotify.h>
 #include <sys/stat.h>
 #include <utility>
@@ -35,7 +36,11 @@ void JournalForest::restore(std::vector<std::unique_ptr<JournalTree>> trees) {
 
 void JournalForest::questionUncovered(const std::vector<JournalTree*>& trees) {
   for (JournalTree* tree : trees) {
-    if (std::exchange(tree->approachChanged, false)) watchApproach(*tree);
+    if (std::exchange(tree->approachChanged, false)) {
+      watchApproach(*tree);
+      // What was looked at while the path led elsewhere was another directory, even when it is back by now.
+      doubtBelow(tree->root());
+    }
     struct stat status {};
     const bool exists = stat(tree->path().c_str(), &status) == 0 && S_ISDIR(status.st_mode);
     if (!exists) status = {};
@@ -84,15 +89,21 @@ bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode 
   settings.mayAddWatches = watches_.size() + batch <= limits_.mostWatches;
   settings.alwaysDigest = !inotify_ || mode == LookMode::ForGood;
   settings.mostEntries = limits_.mostEntries;
-  settings.fileSystems = &fileSystems_;
   settings.deadline = deadline;
   std::vector<DirectoryLook> looks(nodes.size());
+  constexpr std::chrono::milliseconds portion{10};
+  const auto now = std::chrono::steady_clock::now();
+  const auto latestStart = mode == LookMode::InBackground ? std::min(deadline, now + portion) : deadline;
+  std::atomic<std::size_t> found = 0;
   // A share of several nodes is worth the hand-over to another thread.
   constexpr std::size_t share = 16;
   const auto lookAtShare = [&](std::size_t index) {
     const std::size_t end = std::min(nodes.size(), (index + 1) * share);
     for (std::size_t at = index * share; at < end; ++at) {
+      const bool isEnough = found > limits_.mostEntries || std::chrono::steady_clock::now() > latestStart;
+      if (at > 0 && isEnough) continue;
       looks[at] = lookAt(*nodes[at], nodes[at]->tree->pathOf(*nodes[at]), settings);
+      found += looks[at].added.size() + looks[at].recorded.size();
     }
   };
   const std::size_t shares = (nodes.size() + share - 1) / share;
@@ -104,14 +115,16 @@ bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode 
 
   const EventID id = newID_();
   bool isLate = false;
-  for (DirectoryLook& look : looks) {
-    // What an earlier look of the batch found vanished, or exchanged, is no longer there to be installed.
-    if (releasedInBatch_.contains(look.node)) continue;
+  for (std::size_t at = 0; at < nodes.size(); ++at) {
+    DirectoryLook& look = looks[at];
     isLate |= look.isLate;
-    if (look.isLate) {
-      enqueue(*look.node, false);
-    } else {
+    if (look.watch >= 0) watchesToRemove_.push_back(look.watch);  // when it is not installed
+    // What an earlier look of the batch found vanished, or exchanged, is no longer there to be installed.
+    if (releasedInBatch_.contains(nodes[at])) continue;
+    if (look.node && !look.isLate) {
       install(look, id);
+    } else {
+      enqueue(*nodes[at], false);
     }
   }
   releasedInBatch_.clear();
@@ -148,6 +161,7 @@ void JournalForest::doubtBelow(JournalNode& node) {
 }
 
 void JournalForest::release(JournalNode& node) {
+  releasedInBatch_.insert(&node);
   releaseBelow(node);
   if (node.directory) setWatch(node, -1);
   dequeue(node);
@@ -159,10 +173,7 @@ void JournalForest::release(JournalNode& node) {
 void JournalForest::releaseBelow(JournalNode& node) {
   if (!node.directory) return;
   releasedInBatch_.insert(&node);  // what a look found below it is no longer there either
-  for (const auto& [name, child] : node.directory->children) {
-    release(*child);
-    releasedInBatch_.insert(child.get());
-  }
+  for (const auto& [name, child] : node.directory->children) release(*child);
   node.tree->clear(node);
 }
 
@@ -175,6 +186,9 @@ void JournalForest::becomeEmptyDirectory(JournalNode& node) {
 void JournalForest::setWatch(JournalNode& node, int watch) {
   int& current = node.directory->watch;
   if (current == watch) return;
+  // However many links lead to a directory, an event there costs little; the others are uncovered.
+  constexpr std::size_t mostSharing = 64;
+  if (watch >= 0 && watches_.count(watch) >= mostSharing) watch = -1;
   if (current >= 0) {
     const auto [first, last] = watches_.equal_range(current);
     watches_.erase(std::find_if(first, last, [&node](const auto& entry) { return entry.second == &node; }));
@@ -206,6 +220,11 @@ void JournalForest::updateCover(JournalNode& node) {
   } else {
     uncovered_.erase(&node);
   }
+}
+
+void JournalForest::noteTooLarge(JournalTree& tree) {
+  tree.isTooLarge = true;
+  reportOnce(sizeReported_, tree.path() + ": too many entries to tell what changed");
 }
 
 void JournalForest::hint(const JournalTree& tree) {

@@ -117,6 +117,7 @@ class JournalForest {
   void removeUnusedWatches();
   void updateCover(JournalNode& node);
   bool isCovered(JournalNode& directory) const;
+  void noteTooLarge(JournalTree& tree);
   void hint(const JournalTree& tree);
   void reportOnce(bool& reported, const std::string& message);
 
@@ -126,7 +127,6 @@ class JournalForest {
   ConcurrentQueue& pool_;
   OwnedDescriptor inotify_;
   std::vector<std::unique_ptr<JournalTree>> trees_;
-  KnownFileSystems fileSystems_;
   std::unordered_multimap<int, JournalNode*> watches_;
   std::unordered_multimap<int, std::pair<JournalTree*, std::string>> approaches_;
   std::vector<int> watchesToRemove_;

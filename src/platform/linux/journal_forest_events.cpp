@@ -36,17 +36,22 @@ void JournalForest::readEvents() {
         reportOnce(overflowReported_,
                    "Changes came faster than they could be told: looking at everything again");
         doubtEverything();
+        // A look may have recorded what the lost events were to tell.
+        for (const auto& tree : trees_) tree->forgetBefore(id);
         continue;
       }
       noteApproach(event.wd, event.mask, name);
       std::vector<JournalNode*> nodes;
       const auto [first, last] = watches_.equal_range(event.wd);
       for (auto entry = first; entry != last; ++entry) nodes.push_back(entry->second);
-      for (JournalNode* node : nodes) applyEvent(*node, event.mask, name, id);
+      for (JournalNode* node : nodes) {
+        // A directory may hold links to itself: with one of them its other nodes vanish.
+        if (!releasedInBatch_.contains(node)) applyEvent(*node, event.mask, name, id);
+      }
+      if (!releasedInBatch_.empty()) releasedInBatch_ = {};
       if (event.mask & IN_IGNORED) noteLostWatch(event.wd);
     }
   }
-  releasedInBatch_.clear();
   removeUnusedWatches();
 }
 
@@ -103,6 +108,10 @@ void JournalForest::noteAppearance(JournalNode& directory, std::string_view name
     release(*known->second);
     known->second->directory.reset();
     known->second->isBoundless = false;
+  } else if (directory.tree->nodeCount >= limits_.mostEntries) {
+    noteTooLarge(*directory.tree);
+    noteNames(directory, id);
+    return enqueue(directory, true);
   }
   EntryRecord record;
   record.isKnown = isDirectory;

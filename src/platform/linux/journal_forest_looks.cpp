@@ -28,7 +28,7 @@ void JournalForest::install(DirectoryLook& look, EventID id) {
   const bool isDoubted = std::exchange(node.isDoubted, false);
   if (look.hasRecord) {
     const bool led = node.record.leadsToDirectory() && node.record.target.inode == look.record.target.inode;
-    installRecord(node, std::move(look.record), isDoubted, id);
+    installRecord(node, std::move(look.record), isDoubted || !isCovered(*node.parent), id);
     if (node.isBoundless) JournalTree::markChanged(node, id);
     if (!led) return;  // what it leads to now has been queued
   }
@@ -64,6 +64,8 @@ void JournalForest::installRecord(JournalNode& node, EntryRecord record, bool is
 void JournalForest::installListing(DirectoryLook& look, bool isDoubted, EventID id) {
   JournalNode& node = *look.node;
   JournalDirectory& directory = *node.directory;
+  // Only what was watched all the time has its changes told by events.
+  isDoubted |= !isCovered(node) || directory.watch != look.watch;
   setWatch(node, look.watch);
   if (look.watchError == ENOSPC || look.watchError == ENOMEM) {
     reportOnce(exhaustionReported_,
@@ -71,7 +73,6 @@ void JournalForest::installListing(DirectoryLook& look, bool isDoubted, EventID 
                    errorText(look.watchError));
   }
   if (look.error != 0) return installFailure(look, id);
-  fileSystems_.emplace(look.device, look.fileSystem);
   if (!node.parent) {
     node.tree->device = look.device;
     node.tree->inode = look.own.inode;
@@ -104,8 +105,7 @@ void JournalForest::installFailure(DirectoryLook& look, EventID id) {
   JournalNode& node = *look.node;
   JournalDirectory& directory = *node.directory;
   if (look.error == E2BIG) {
-    node.tree->isTooLarge = true;
-    reportOnce(sizeReported_, node.tree->path() + ": too many entries to tell what changed");
+    noteTooLarge(*node.tree);
     return enqueue(node, true);
   }
   // Where one cannot look everything may have changed, whenever it is asked about.
@@ -158,10 +158,7 @@ void JournalForest::enforceLimits(JournalNode& directory) {
     link->isBoundless = true;
     updateCover(*link);
   }
-  if (tree.nodeCount > limits_.mostEntries && !tree.isTooLarge) {
-    tree.isTooLarge = true;
-    reportOnce(sizeReported_, tree.path() + ": too many entries to tell what changed");
-  }
+  if (tree.nodeCount > limits_.mostEntries) noteTooLarge(tree);
   if (tree.vanishedCount > limits_.mostVanished) tree.forgetVanished(newID_());
 }
 

@@ -13,7 +13,7 @@ namespace {
 using Clock = std::chrono::steady_clock;
 using LookMode = JournalForest::LookMode;
 
-constexpr std::string_view positionFormat = "kel journal position 1";
+constexpr std::string_view positionFormat = "kel journal position 2";
 
 }  // namespace
 
@@ -34,13 +34,16 @@ void JournalKeeper::open() {
   if (!keepsIndex()) return;
   const FileReading position = files_.read(positionPath_, 4096);
   auto reader = position.bytes ? ByteReader::open(*position.bytes, positionFormat) : std::nullopt;
-  if (!reader) {
+  const EventID reserved = reader ? reader->number() : 0;
+  const EventID lastTold = reader ? reader->number() : 0;
+  // A position that large was never given out, and leaves no room for others.
+  if (!reader || !reader->atEnd() || reserved > JournalTree::noHorizon / 2) {
     // Without it an index may be older than positions that were given out: events would get smaller ones.
     if (position.bytes) log_.write(positionPath_ + ": damaged, starting without a journal");
     files_.remove(indexPath_);
     return;
   }
-  lastID_ = reader->number();
+  lastID_ = reserved;
   const FileReading file = files_.read(indexPath_, largestOwnFile);
   if (!file.bytes) return;
   auto index = decodeIndex(*file.bytes, roots_);
@@ -48,6 +51,9 @@ void JournalKeeper::open() {
   lastID_ = std::max(lastID_, index->lastID);
   forest_.restore(std::move(index->trees));
   savedEvent_ = latestEvent();
+  if (index->lastID >= lastTold) return;
+  // Who asked after it was written may know what it does not hold, and what is the same again by now.
+  for (const auto& tree : forest_.trees()) tree->forgetBefore(lastID_);
 }
 
 EventID JournalKeeper::newID() {
@@ -55,13 +61,18 @@ EventID JournalKeeper::newID() {
   return lastID_;
 }
 
-/// The index file is written now and then; positions are safe from being given out twice at once.
+/// The index file is written now and then; positions are safe from being given out twice at once. The first
+/// one that covers events which the index file does not hold is noted, too.
 void JournalKeeper::reserve(EventID id) {
   constexpr EventID ahead = 600'000'000'000;
-  if (id <= reservedID_ || !keepsIndex()) return;
-  reservedID_ = id + ahead;
+  const EventID latest = latestEvent();
+  const bool tellsMore = latest > savedEvent_ && lastTold_ <= savedEvent_;
+  if ((id <= reservedID_ && !tellsMore) || !keepsIndex()) return;
+  if (id > reservedID_) reservedID_ = id + ahead;
+  lastTold_ = latest;
   ByteWriter writer;
   writer.number(reservedID_);
+  writer.number(lastTold_);
   if (const auto error = files_.writeAtomically(positionPath_, writer.sealed(positionFormat))) {
     if (!std::exchange(failureReported_, true)) log_.write("Cannot keep the journal's position: " + *error);
   }

@@ -75,6 +75,7 @@ class JournalKeeper {
   EventID lastID_ = 0;
   EventID reservedID_ = 0;  ///< a later process starts behind it
   EventID savedEvent_ = 0;
+  EventID lastTold_ = 0;  ///< the newest event when the position file was written
   bool failureReported_ = false;
   std::optional<std::chrono::steady_clock::time_point> lastLate_;  // when time last ran out
   JournalForest forest_;

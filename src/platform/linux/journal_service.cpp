@@ -1,6 +1,7 @@
 #include "platform/linux/journal_service.h"
 
 #include <algorithm>
+#include <poll.h>
 #include <sys/epoll.h>
 
 namespace kel::platform {
@@ -56,6 +57,7 @@ JournalService::JournalService(std::vector<WatchedRoot> roots, const JournalOpti
 
 JournalService::~JournalService() {
   writing_.wait();
+  isClosing_ = true;
   queue_.sync([this] {
     eventWatch_.reset();
     mountWatch_.reset();
@@ -73,6 +75,7 @@ void JournalService::setChangeHandler(ChangeHandler changed) {
 EventID JournalService::currentEventID() {
   EventID id = 0;
   queue_.sync([&] {
+    noteMounts();
     id = keeper_.currentEventID();
     finishRound();
   });
@@ -82,6 +85,7 @@ EventID JournalService::currentEventID() {
 bool JournalService::changedSince(const std::vector<std::string>& paths, EventID since) {
   bool changed = true;
   queue_.sync([&] {
+    noteMounts();
     changed = !keeper_.eventsSince(since, paths, true).empty();
     finishRound();
   });
@@ -90,6 +94,8 @@ bool JournalService::changedSince(const std::vector<std::string>& paths, EventID
 
 void JournalService::subscribe(std::shared_ptr<JournalSubscription> subscription) {
   queue_.async([this, subscription = std::move(subscription)] {
+    std::erase_if(subscriptions_, [](const auto& entry) { return entry.expired(); });
+    noteMounts();
     std::vector<JournalEvent> events =
         keeper_.eventsSince(subscription->position(), subscription->paths(), subscription->watchesRoot());
     events.push_back({{}, event_flags::historyDone, keeper_.lastID()});
@@ -109,7 +115,10 @@ void JournalService::open() {
     eventWatch_ = loop.watch(events, EPOLLIN, [this](std::uint32_t) { readEvents(); });
     if (!eventWatch_) log_.write("Cannot wait for changes of watched directories");
     if (mounts_.descriptor() >= 0) {
-      mountWatch_ = loop.watch(mounts_.descriptor(), EPOLLPRI, [this](std::uint32_t) { readMounts(); });
+      mountWatch_ = loop.watch(mounts_.descriptor(), EPOLLPRI, [this](std::uint32_t) {
+        doubtMounts();
+        finishRound();
+      });
     }
   }
   // Whoever started the server waits for a first answer, which needs the processors more.
@@ -119,7 +128,7 @@ void JournalService::open() {
 
 /// In portions, so that questions are answered in between.
 void JournalService::lookFurther() {
-  if (keeper_.lookInBackground()) {
+  if (!isClosing_ && keeper_.lookInBackground()) {
     queue_.async([this] { lookFurther(); });
   } else {
     isLooking_ = false;
@@ -151,17 +160,25 @@ void JournalService::readEvents() {
   });
 }
 
-void JournalService::readMounts() {
-  if (!mounts_.hasChanged()) return;
-  keeper_.forest().doubtEverything();
-  finishRound();
+/// A question may come before the loop has seen that the table changed.
+void JournalService::noteMounts() {
+  pollfd table{mounts_.descriptor(), POLLPRI, 0};
+  if (table.fd >= 0 && poll(&table, 1, 0) > 0) doubtMounts();
+}
+
+void JournalService::doubtMounts() {
+  if (mounts_.hasChanged()) keeper_.forest().doubtEverything();
 }
 
 /// After whatever may have found something.
 void JournalService::finishRound() {
   const JournalForest::Hints hints = keeper_.forest().takeHints();
   if ((hints.services || hints.applications) && changed_) changed_(hints);
-  if (hints.services || hints.applications) deliverLive();
+  if (hints.services || hints.applications) {
+    deliverLive();
+    // The questions may have found more, which no event will announce again.
+    if (!subscriptions_.empty()) queue_.after(betweenGulps, [this] { finishRound(); });
+  }
   scheduleLook();
   scheduleSaving();
 }

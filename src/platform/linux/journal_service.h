@@ -81,7 +81,8 @@ class JournalService {
   void look();
   void lookFurther();
   void readEvents();
-  void readMounts();
+  void noteMounts();
+  void doubtMounts();
   void scheduleLook();
   void finishRound();
   void deliverLive();
@@ -106,6 +107,7 @@ class JournalService {
   bool isLooking_ = false;  // or about to
   bool isSavingScheduled_ = false;
 
+  std::atomic<bool> isClosing_ = false;
   std::atomic<bool> isWriting_ = false;
   Group writing_;
   SerialQueue queue_;

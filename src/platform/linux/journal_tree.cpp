@@ -107,6 +107,10 @@ void JournalTree::clear(JournalNode& node) {
 void JournalTree::forgetVanished(EventID newHorizon) {
   forgetVanishedBelow(root_);
   vanishedCount = 0;
+  forgetBefore(newHorizon);
+}
+
+void JournalTree::forgetBefore(EventID newHorizon) {
   if (horizon != noHorizon) horizon = std::max(horizon, newHorizon);
 }
 

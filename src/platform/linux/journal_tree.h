@@ -81,6 +81,9 @@ class JournalTree {
   /// Gives up everything below the node.
   void clear(JournalNode& node);
 
+  /// Events up to `newHorizon` can no longer be told.
+  void forgetBefore(EventID newHorizon);
+
   /// Forgets what vanished; events up to `newHorizon` can no longer be told.
   void forgetVanished(EventID newHorizon);
 
