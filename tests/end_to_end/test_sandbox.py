@@ -14,10 +14,10 @@ GERMAN = {"localizations": ["German"]}
 # Connects, hands the connection to the test and, as the process that made it, lives until the test lets go.
 CLIENT = """
 import ctypes, os, socket, sys
-if "UNDUMPABLE" in os.environ:
-    ctypes.CDLL(None).prctl(4, 0, 0, 0, 0)  # PR_SET_DUMPABLE
+os.chdir(os.path.dirname(sys.argv[1]))
+exec(os.environ.get("CONFINEMENT", ""))
 with socket.socket(socket.AF_UNIX) as made, socket.socket(fileno=int(sys.argv[2])) as test:
-    made.connect(sys.argv[1])
+    made.connect(os.path.basename(sys.argv[1]))
     socket.send_fds(test, [b"!"], [made.fileno()])
 sys.stdin.read()
 """
@@ -71,10 +71,22 @@ def application_runtime(home):
     return bubblewrapped(*binds, "--bind", str(home.root), str(home.root), "--ro-bind", str(information), "/.flatpak-info")
 
 
+def prepared(statement):
+    """Confined by what it does before it connects."""
+    return ["env", f"CONFINEMENT={statement}"]
+
+
+def another_root(home):
+    if os.geteuid() != 0:
+        pytest.skip("only the superuser may change the root")
+    return prepared("os.chroot('/usr')")
+
+
 CONFINEMENTS = {
     "user namespace": lambda home: bubblewrapped("--unshare-user", "--dev-bind", "/", "/"),
     "application runtime": application_runtime,
-    "not to be inspected": lambda home: ["env", "UNDUMPABLE=1"],
+    "another root": another_root,
+    "not to be inspected": lambda home: prepared("ctypes.CDLL(None).prctl(4, 0, 0, 0, 0)"),  # PR_SET_DUMPABLE
 }
 
 

@@ -1,13 +1,16 @@
 """Hostile and clumsy peers, many clients, and ends of every kind."""
 
 import concurrent.futures
+import os
 import plistlib
 import random
+import select
 import signal
+import socket
 import subprocess
 
 import pytest
-from conftest import DROPPED, GET, REPLY, UPDATE, encode, frame
+from conftest import DROPPED, GET, UPDATE, encode, frame
 
 MANY = 200
 
@@ -21,26 +24,11 @@ def crowded(home):
     return home
 
 
-def test_a_request_of_no_known_kind_is_dropped_and_logged(home):
-    home.start()
-    peer = home.connect()
-    for message in ({}, {"command": "FLUSH"}, {"command": ["flush"]}, {"localizations": ["German", 7]}, ["flush"], 7):
-        assert peer.ask(message) == DROPPED, message
-    home.expect_log("unknown Conduit message")
-    assert peer.ask(GET) != DROPPED, "the connection should go on"
-
-
 BROKEN = {
     "nothing": b"",
-    "half a header": frame(b"")[:7],
     "half a payload": frame(encode(GET))[:-5],
     "a giant length": frame(b"", length=0xFFFFFFFF),
     "garbage": bytes(range(255, 0, -1)) * 40,
-    "text": b"GET / HTTP/1.1\r\n\r\n" * 20,
-    "no property list": frame(b"certainly not"),
-    "an empty payload": frame(b""),
-    "a reply": frame(encode({}), kind=REPLY),
-    "an unknown kind": frame(encode(GET), kind=77),
     "deep nesting": frame(b"(" * 100_000),
     "a request cut by the end": frame(encode(UPDATE)) + frame(encode(UPDATE))[:20],
 }
@@ -56,6 +44,17 @@ def test_a_broken_peer_costs_only_itself(served, then_close):
         if then_close:
             peers[-1].socket.close()
         assert served.ask(GET) == expected, what
+
+
+def test_descriptors_that_somebody_sends_are_closed_at_once(home):
+    home.start()
+    peer = home.connect()
+    ours, theirs = os.pipe()
+    socket.send_fds(peer.socket, [frame(encode(GET))], [theirs])
+    os.close(theirs)
+    assert peer.receive()
+    assert select.select([ours], [], [], 30)[0], "the server still has the descriptor"
+    os.close(ours)
 
 
 def test_a_crowd_of_silent_clients_does_not_keep_others_waiting(served):
