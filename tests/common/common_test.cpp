@@ -1,38 +1,22 @@
 #include "common/common.h"
 
-#include <gmock/gmock.h>
+#include <cstdlib>
+#include <gtest/gtest.h>
 #include <random>
 #include <thread>
 
 #include "common/path_set.h"
 #include "support/debug_lines.h"
-#include "support/in_memory_directories.h"
-#include "support/in_memory_services.h"
 
 namespace kel {
 namespace {
 
 using test::debugLines;
-using testing::ElementsAre;
 
-TEST(DebugSinkTest, LinesAreJoinedWithoutATrailingNewlineAndNothingIsFormattedWithoutASink) {
-  EXPECT_EQ(debugLines([] {
-              for (const char* line : {"a", "b", "c"}) send_debug_line([line] { return std::string(line); });
-            }),
-            "a\nb\nc");
-  EXPECT_EQ(debugLines([] {}), "");
-  bool formatted = false;
-  send_debug_line([&] {
-    formatted = true;
-    return std::string();
-  });
-  EXPECT_FALSE(formatted);
-}
-
-TEST(DebugSinkTest, NestedSinksAreRestoredInReverseOrderAndNoneIsASinkToo) {
+TEST(DebugSinkTest, NestedSinksAreRestoredInReverseOrderAndNothingIsFormattedForNone) {
   const std::string outer = debugLines([] {
     const std::string inner = debugLines([] { send_debug_line([] { return "inner"; }); });
-    run_with_debug_sink(nullptr, [] { send_debug_line([] { return "nobody hears this"; }); });
+    run_with_debug_sink(nullptr, [] { send_debug_line([]() -> std::string { std::abort(); }); });
     send_debug_line([&] { return "outer after " + inner; });
   });
   EXPECT_EQ(outer, "outer after inner");
@@ -52,30 +36,6 @@ TEST(DebugSinkTest, ASinkBelongsToItsThreadAndParallelWorkersShareTheCallers) {
   for (const int element : elements) {
     EXPECT_NE(lines.find(std::string(20, static_cast<char>('0' + element))), std::string::npos) << lines;
   }
-}
-
-TEST(RunningFromLauncherTest, OnlyExactlyOneSelectsTheServer) {
-  test::InMemoryFacts facts;
-  EXPECT_FALSE(running_from_launcher(facts));
-  for (const auto& [value, expected] : std::vector<std::pair<std::string, bool>>{
-           {"1", true}, {"", false}, {"0", false}, {"true", false}, {"1 ", false}, {"11", false}}) {
-    facts.environment["QVRunningFromWarden"] = value;
-    EXPECT_EQ(running_from_launcher(facts), expected) << "'" << value << "'";
-  }
-}
-
-TEST(DirectoriesTest, ServiceDirectoriesStandInTheirOrderAndEndInASlash) {
-  test::InMemoryDirectories directories;
-  EXPECT_THAT(explicit_service_directories(directories),
-              ElementsAre("/OrvexInternal/Applications/", "/home/u/Library/Services/", "/Library/Services/",
-                          "/Network/Library/Services/", "/System/Library/Services/",
-                          "/OrvexInternal/Library/Services/"));
-}
-
-TEST(MapArrayTest, ResultsKeepTheirOrderAndAbsentOnesDropOut) {
-  const std::vector<int> numbers{3, 1, 4, 1, 5};
-  EXPECT_THAT(map_array(numbers, [](int n) { return n == 1 ? std::nullopt : std::optional(n * 10); }),
-              ElementsAre(30, 40, 50));
 }
 
 TEST(PathSetTest, AnswersLikeAWalkOverAllElements) {

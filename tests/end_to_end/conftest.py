@@ -152,11 +152,6 @@ class Home:
     def log(self):
         return self.log_path.read_text(errors="replace")
 
-    def expect_log(self, text):
-        """The system log holds `text`: seen only where no log service takes it from the standard error."""
-        if not os.path.exists("/dev/log"):
-            wait_until(lambda: text in self.log(), f"{text!r} in the log")
-
 
 @pytest.fixture
 def home():
