@@ -1,47 +1,23 @@
 #include "datastore/data_store.h"
 
-#include <gmock/gmock.h>
 #include <regex>
 
 #include "support/debug_lines.h"
 #include "support/in_memory_platform.h"
 #include "support/property_lists.h"
 
-namespace kel {
+namespace kel::test {
 namespace {
 
-using platform::PropertyListArray;
-using platform::PropertyListDictionary;
-using platform::PropertyListDictionaryBuilder;
-using platform::PropertyListValue;
-using test::debugLines;
-using test::dictionary;
-using test::InMemoryPlatform;
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::IsEmpty;
-using Paths = std::vector<std::string>;
-
-const std::string cachePath = "/home/u/.cache/com.orvex.qvservicescache.plist";
 const std::string services = "/home/u/Library/Services/";
 const std::string one = services + "one.service";
 const std::string two = services + "two.service";
-const std::string restrictions = "/System/Library/CoreAgents/com.orvex.QVServicesRestrictions.plist";
-
-PropertyListDictionary service(const std::string& title) {
-  return dictionary({{"QVMenuItem", dictionary({{"default", title}})}, {"QVMessage", "go"}});
-}
-
-/// An information dictionary with one service of this title.
-PropertyListDictionary information(const std::string& identifier, const std::string& title) {
-  return dictionary({{"KTBundleIdentifier", identifier}, {"QVServices", PropertyListArray{service(title)}}});
-}
 
 std::unique_ptr<KELDataStore> makeStore(InMemoryPlatform& system) {
   return KELDataStore::initWithSystemServices(system.platform);
 }
 
-Paths titles(KELDataStore& store) { return test::defaultTitles(store.currentPublicDictionaries()); }
+Names titles(KELDataStore& store) { return defaultTitles(store.currentPublicDictionaries()); }
 
 /// Debug lines without the entries' addresses.
 std::string lines(const std::function<void()>& work) {
@@ -54,12 +30,12 @@ class DataStoreTest : public testing::Test {
     addBundle(system.files, one, information("org.a.one", "One"));
     addBundle(system.files, two, information("org.a.two", "Two"));
     addApplication("/Applications/App.app", information("org.a.app", "App"));
-    system.files.addPropertyList(restrictions, dictionary({}));
+    system.files.addPropertyList(restrictionsPath, dictionary({}));
   }
 
-  void addApplication(const std::string& path, const PropertyListDictionary& declared) {
+  void addApplication(const std::string& path, const Dictionary& declared) {
     addBundle(system.files, path, declared);
-    system.registry.add(path);
+    system.registry.registered.push_back({path});
   }
 
   std::string update(KELStaleCacheFlags flags) {
@@ -75,9 +51,8 @@ class DataStoreTest : public testing::Test {
     });
   }
 
-  PropertyListDictionary cacheFile() {
-    const auto reading = platform::readPropertyList(system.files.contents(cachePath).value());
-    return *reading.value->asDictionary();
+  Dictionary cacheFile() {
+    return *platform::readDictionaryFile(system.files, cachePath, platform::largestOwnFile).dictionary;
   }
 
   InMemoryPlatform system;
@@ -91,13 +66,17 @@ TEST_F(DataStoreTest, TheFirstUpdateReadsEverySourceAndSaysSo) {
                               "0 path(s) from AppRegistry"));
   EXPECT_THAT(told, HasSubstr("Service providing paths:\n\t/Applications/App.app"));
   EXPECT_THAT(told, HasSubstr("Scanning directory: " + services));
+  EXPECT_THAT(told, HasSubstr("Scanning directory: /OrvexInternal/Applications/"));
   EXPECT_THAT(told, HasSubstr("Creating entry <entry> for path /Applications/App.app"));
   EXPECT_THAT(titles(*store), ElementsAre("App", "One", "Two"));
+  EXPECT_EQ(lines([&] { store->fetchLocalizations(std::nullopt); }), "");
+  const std::string fetched = lines([&] { store->fetchLocalizations(Names{"French", "German"}); });
+  EXPECT_THAT(fetched, StartsWith("Fetching localization(s): French, German"));
 }
 
 TEST_F(DataStoreTest, ARestartFromTheCacheListsNoDirectoryOpensNoBundleAndGivesTheSameList) {
   update(KELStaleEverything);
-  const PropertyListValue list = store->currentPublicDictionaries();
+  const Value list = store->currentPublicDictionaries();
   writeCache();
   system.files.forgetUses();
   const int opens = system.bundles.opens;
@@ -112,16 +91,16 @@ TEST_F(DataStoreTest, ARestartFromTheCacheListsNoDirectoryOpensNoBundleAndGivesT
 }
 
 TEST_F(DataStoreTest, TheCacheFileHoldsExactlyItsKeysAndSurvivesAFailedWrite) {
-  EXPECT_THAT(writeCache(), testing::MatchesRegex("Wrote out cache file \\([0-9]+ bytes\\)"));
-  const PropertyListDictionary cache = cacheFile();
-  Paths keys;
+  EXPECT_THAT(writeCache(), MatchesRegex("Wrote out cache file \\([0-9]+ bytes\\)"));
+  const Dictionary cache = cacheFile();
+  Names keys;
   for (const auto& [key, value] : cache) keys.push_back(key.text());
   EXPECT_THAT(keys, ElementsAre("QVServicesARPaths", "QVServicesBuildVersion",
                                 "QVServicesExplicitDirectoryCache", "QVServicesLastEventID",
                                 "QVServicesRestrictionLists", "QVServicesSessionID", "ServicesCache"));
   EXPECT_EQ(*cache.find("QVServicesSessionID"), "1700000000,100004");
   EXPECT_EQ(*cache.find("QVServicesLastEventID"), 1000);
-  EXPECT_EQ(*cache.find("QVServicesARPaths"), (PropertyListArray{"/Applications/App.app"}));
+  EXPECT_EQ(*cache.find("QVServicesARPaths"), (Array{"/Applications/App.app"}));
   EXPECT_EQ(cache.find("ServicesCache")->asDictionary()->size(), 3U);
   EXPECT_EQ(system.transactions.openCount, 0);
 
@@ -130,7 +109,7 @@ TEST_F(DataStoreTest, TheCacheFileHoldsExactlyItsKeysAndSurvivesAFailedWrite) {
   EXPECT_EQ(cacheFile(), cache);
 
   store = makeStore(system);
-  system.files.removeTree(restrictions);
+  system.files.removeTree(restrictionsPath);
   store->writeCaches();
   store->flushCaches();
   EXPECT_FALSE(system.files.isFile(cachePath)) << "a deletion overtook the write queued before it";
@@ -140,34 +119,24 @@ TEST_F(DataStoreTest, ADamagedOrForeignCacheIsLeftOutAsFarAsItIsWrong) {
   const std::string foreign =
       "Ignoring cache because it has the wrong version\nCache contains 0 keys\n0 path(s)";
   const auto entries = dictionary({{"/x", "text"}, {"/y", dictionary({{"bundle_id", "org.cached"}})}});
-  struct Case {
-    PropertyListValue version;
-    std::vector<PropertyListDictionary::Entry> rest;
-    std::string expected;
-  };
-  for (Case c : {
-           Case{"linux 2", {{"QVServicesLastEventID", 5}}, foreign},
-           Case{1, {}, foreign},
-           Case{"linux 1",
-                {{"QVServicesLastEventID", "5"}},
-                "Cache read OK\nCache contains 2 keys\n0 path(s)"},
-           Case{"linux 1", {{"QVServicesLastEventID", 5}}, "2 keys\nEventStreamID was 5\n0 path(s)"},
-           Case{"linux 1",
-                {{"ServicesCache", entries}},
-                "AppRegistry\nLoaded cached entry <entry> for path /y"},
-           Case{"linux 1",
-                {{"QVServicesARPaths", "text"},
-                 {"QVServicesRestrictionLists", 1},
-                 {"QVServicesExplicitDirectoryCache", dictionary({{services, "text"}})},
-                 {"ServicesCache", PropertyListArray{}}},
-                "Cache contains 5 keys\n0 path(s) from AppRegistry"},
-       }) {
-    c.rest.emplace_back("QVServicesBuildVersion", c.version);
-    system.files.addPropertyList(cachePath, dictionary(c.rest));
+  const Dictionary::Entry current{"QVServicesBuildVersion", "linux 1"};
+  for (const auto& [fields, expected] : std::vector<std::pair<Entries, std::string>>{
+           {{{"QVServicesBuildVersion", "linux 2"}, {"QVServicesLastEventID", 5}}, foreign},
+           {{{"QVServicesBuildVersion", 1}}, foreign},
+           {{current, {"QVServicesLastEventID", "5"}}, "Cache read OK\nCache contains 2 keys\n0 path(s)"},
+           {{current, {"QVServicesLastEventID", 5}}, "2 keys\nEventStreamID was 5\n0 path(s)"},
+           {{current, {"ServicesCache", entries}}, "AppRegistry\nLoaded cached entry <entry> for path /y"},
+           {{current,
+             {"QVServicesARPaths", "text"},
+             {"QVServicesRestrictionLists", 1},
+             {"QVServicesExplicitDirectoryCache", dictionary({{services, "text"}})},
+             {"ServicesCache", Array{}}},
+            "Cache contains 5 keys\n0 path(s) from AppRegistry"}}) {
+    system.files.addPropertyList(cachePath, dictionary(fields));
     const auto own = makeStore(system);
-    EXPECT_THAT(lines([&] { own->loadCache(); }), HasSubstr(c.expected));
-    EXPECT_FALSE(own->cacheIsFromThisBootSession()) << c.expected;
-    EXPECT_THAT(titles(*own), IsEmpty()) << c.expected;
+    EXPECT_THAT(lines([&] { own->loadCache(); }), HasSubstr(expected));
+    EXPECT_FALSE(own->cacheIsFromThisBootSession()) << expected;
+    EXPECT_THAT(titles(*own), IsEmpty()) << expected;
   }
   system.files.addText(cachePath, "bplist00 but no more");
   EXPECT_THAT(lines([&] { makeStore(system)->loadCache(); }), HasSubstr("came back nil (file does exist)"));
@@ -182,8 +151,8 @@ TEST_F(DataStoreTest, TheBootSessionIsKeptForTheProcessAndComparedWithTheCache) 
     return makeStore(later)->cacheIsFromThisBootSession();
   };
   EXPECT_TRUE(sameSystemLater([](auto&) {}));
-  EXPECT_FALSE(sameSystemLater([](test::InMemoryFacts& facts) { facts.boot.value = 1700000001; }));
-  EXPECT_FALSE(sameSystemLater([](test::InMemoryFacts& facts) { facts.session.value = -1; }));
+  EXPECT_FALSE(sameSystemLater([](InMemoryFacts& facts) { facts.boot.value = 1700000001; }));
+  EXPECT_FALSE(sameSystemLater([](InMemoryFacts& facts) { facts.session.value = -1; }));
 
   InMemoryPlatform broken;
   broken.facts.boot = {std::nullopt, 2, "No such file or directory"};
@@ -197,17 +166,7 @@ TEST_F(DataStoreTest, TheBootSessionIsKeptForTheProcessAndComparedWithTheCache) 
   EXPECT_EQ(identity, "0,0");
 }
 
-TEST_F(DataStoreTest, AFlushForgetsTheListsButNotTheRegistry) {
-  update(KELStaleEverything);
-  store->flushCaches();
-  EXPECT_THAT(titles(*store), IsEmpty());
-  const std::size_t queries = system.registry.queries;
-  EXPECT_THAT(update(0), HasSubstr("Scanning directory: " + services));
-  EXPECT_EQ(system.registry.queries, queries);
-  EXPECT_THAT(titles(*store), ElementsAre("App", "One", "Two"));
-}
-
-TEST_F(DataStoreTest, FlagsSayWhichSourcesAreReadAgain) {
+TEST_F(DataStoreTest, FlagsSayWhichSourcesAreReadAgainAndAFlushKeepsTheRegistry) {
   update(KELStaleEverything);
   system.files.forgetUses();
   const std::size_t queries = system.registry.queries;
@@ -229,6 +188,9 @@ TEST_F(DataStoreTest, FlagsSayWhichSourcesAreReadAgain) {
   EXPECT_EQ(system.journal.creations.back().since, 1000U);
   update(KELStaleServiceDirectories);
   EXPECT_EQ(system.journal.creations.back().since, 1001U) << "resumes where the last update began";
+  store->flushCaches();
+  EXPECT_THAT(update(0), HasSubstr("Scanning directory: " + services));
+  EXPECT_EQ(system.registry.queries, queries + 1);
 }
 
 TEST_F(DataStoreTest, AChangeInsideAKnownBundleReloadsThatBundleUnlessTheJournalFails) {
@@ -267,7 +229,7 @@ TEST_F(DataStoreTest, CopiesAreDecidedArchivesSkippedAndEntriesWithoutIdentifier
   addApplication("/Applications/Copy of One.app", information("org.a.one", "Loser"));
   for (const std::string identifier : {"!first", "0digit"})
     addBundle(system.files, services + identifier + ".service", information(identifier, identifier));
-  const PropertyListArray nameless{service("Nameless"), service("Also nameless")};
+  const Array nameless{service("Nameless"), service("Also nameless")};
   addBundle(system.files, services + "nameless.service", dictionary({{"QVServices", nameless}}));
   const std::string told = debugLines([&] {
     store->updateServicesCache(KELStaleEverything);
@@ -281,65 +243,45 @@ TEST_F(DataStoreTest, CopiesAreDecidedArchivesSkippedAndEntriesWithoutIdentifier
 
 TEST_F(DataStoreTest, SpellCheckersSurviveOnlyWhereTheyMayLive) {
   const auto spellChecker = [](const std::string& title) {
-    PropertyListDictionaryBuilder declared(service(title));
+    DictionaryBuilder declared(service(title));
     declared.set("QVSpellChecker", "checker");
-    return PropertyListArray{declared.build(), service(title + " plain")};
+    return Array{declared.build(), service(title + " plain")};
   };
   for (const auto& [path, title] : std::vector<std::pair<std::string, std::string>>{
            {"/home/u/Library/Services/s.service", "user"},
            {"/OrvexInternal/Library/Services/s.service", "internal"},
            {"/home/u/Library/Services2/s.app", "sibling"},
            {"/Applications/s.app", "application"}}) {
-    addBundle(system.files, path,
-              dictionary({{"KTBundleIdentifier", title}, {"QVServices", spellChecker(title)}}));
-    if (path.ends_with(".app")) system.registry.add(path);
+    const auto declared = dictionary({{"KTBundleIdentifier", title}, {"QVServices", spellChecker(title)}});
+    addBundle(system.files, path, declared);
+    if (path.ends_with(".app")) system.registry.registered.push_back({path});
   }
   update(KELStaleEverything);
   EXPECT_THAT(titles(*store), ElementsAre("application plain", "internal plain", "App", "One", "Two",
                                           "sibling", "sibling plain", "user", "user plain"));
 }
 
-TEST_F(DataStoreTest, LocalizationsReachTheListAndTheCache) {
-  addMenuStrings(system.files, one, "German", dictionary({{"One", "Eins"}}));
-  const auto menuItem = [&] {  // of the second service, after that of "App"
-    const PropertyListValue list = store->currentPublicDictionaries();
-    return *list.asArray()->at(1).asDictionary()->find("QVMenuItem");
-  };
-  update(KELStaleEverything);
-  EXPECT_EQ(debugLines([&] { store->fetchLocalizations(std::nullopt); }), "");
-  EXPECT_THAT(debugLines([&] {
-                store->fetchLocalizations({{"French", "German"}});
-              }),
-              testing::StartsWith("Fetching localization(s): French, German"));
-  EXPECT_EQ(menuItem(), dictionary({{"default", "One"}, {"German", "Eins"}}));
-  writeCache();
-  store = makeStore(system);
-  EXPECT_EQ(menuItem(), dictionary({{"default", "One"}, {"German", "Eins"}}));
-}
-
 TEST_F(DataStoreTest, RestrictionsAreReadAgainOnlyWhenTold) {
   addBundle(system.files, one, information("com.orvex.one", "One"));
-  const auto restricted = [&] {
-    const auto& list = *store->currentPublicDictionaries().asArray();
-    return std::count_if(list.begin(), list.end(), [](const auto& entry) {
-      return entry.asDictionary()->find("QVRestricted") != nullptr;
-    });
+  const auto isRestricted = [&] {
+    const Value list = store->currentPublicDictionaries();
+    return list.asArray()->front().asDictionary()->find("QVRestricted") != nullptr;
   };
   update(KELStaleEverything);
-  EXPECT_EQ(restricted(), 1);
-  const PropertyListArray row{dictionary({{"QVBundleID", "com.orvex.one"}, {"QVMenuItem", "One"}})};
-  system.files.addPropertyList(restrictions, dictionary({{"QVUnrestricted", row}}));
+  EXPECT_TRUE(isRestricted());
+  const Array row{dictionary({{"QVBundleID", "com.orvex.one"}, {"QVMenuItem", "One"}})};
+  system.files.addPropertyList(restrictionsPath, dictionary({{"QVUnrestricted", row}}));
   update(KELStaleAppRegistryPaths);
-  EXPECT_EQ(restricted(), 1);
+  EXPECT_TRUE(isRestricted());
   update(KELStaleRestrictionLists);
-  EXPECT_EQ(restricted(), 0);
-  system.files.removeTree(restrictions);
+  EXPECT_FALSE(isRestricted());
+  system.files.removeTree(restrictionsPath);
   update(KELStaleRestrictionLists);
-  EXPECT_EQ(restricted(), 0) << "a missing file took the lists away";
+  EXPECT_FALSE(isRestricted()) << "a missing file took the lists away";
 }
 
 TEST(PathsToObserveTest, ThreeNeighboursAreWatchedThroughTheirDirectoryAndNothingTwice) {
-  for (const auto& [paths, expected] : std::vector<std::pair<Paths, Paths>>{
+  for (const auto& [paths, expected] : std::vector<std::pair<Names, Names>>{
            {{}, {}},
            {{"/A/x.app", "/A/x.app/in.app"}, {"/A/x.app", "/A/x.app/in.app"}},
            {{"/A/x.app", "/A/y.app", "/A/z.app", "/A/B/w.app"}, {"/A/"}},
@@ -353,4 +295,4 @@ TEST(PathsToObserveTest, ThreeNeighboursAreWatchedThroughTheirDirectoryAndNothin
 }
 
 }  // namespace
-}  // namespace kel
+}  // namespace kel::test

@@ -1,9 +1,7 @@
 #include "entries/app_entry.h"
 
-#include <gmock/gmock.h>
 #include <limits>
 
-#include "common/common.h"
 #include "support/debug_lines.h"
 #include "support/in_memory_platform.h"
 #include "support/property_lists.h"
@@ -12,15 +10,6 @@ namespace kel::test {
 namespace {
 
 using platform::Bytes;
-using platform::PropertyListDictionaryBuilder;
-using testing::ElementsAre;
-using testing::IsEmpty;
-using testing::SizeIs;
-using Array = platform::PropertyListArray;
-using Dictionary = platform::PropertyListDictionary;
-using Entries = std::vector<Dictionary::Entry>;
-using Names = std::vector<std::string>;
-using Value = platform::PropertyListValue;
 
 /// A platform, one bundle and its entry.
 class AppEntryTest : public testing::Test {
@@ -37,10 +26,10 @@ class AppEntryTest : public testing::Test {
   }
 
   static std::vector<Dictionary> publicServices(const KELAppEntry& entry) {
-    std::vector<PropertyListDictionaryBuilder> services;
+    std::vector<DictionaryBuilder> services;
     entry.addPublicDictionariesForServices(services);
     std::vector<Dictionary> result;
-    for (const PropertyListDictionaryBuilder& service : services) result.push_back(service.build());
+    for (const DictionaryBuilder& service : services) result.push_back(service.build());
     return result;
   }
 
@@ -100,7 +89,7 @@ TEST_F(AppEntryTest, MenuStringsSurviveARefreshUnlessOneOfTheFourValuesChanged) 
   for (const char* key : {"Icon", "KTBundleIdentifier", "KTBundleName", "KTBundleVersion", "QVServices"}) {
     refresh(information);
     entry->setLocalizationToMenuStrings(dictionary({{"German", german}}));
-    PropertyListDictionaryBuilder changed(information);
+    DictionaryBuilder changed(information);
     changed.set(key, "new");
     refresh(changed.build());
     EXPECT_EQ(entry->localizationToMenuStrings().has_value(), key == std::string("Icon")) << key;
@@ -136,24 +125,16 @@ TEST_F(AppEntryTest, LocalizationWalkStopsAtTheFirstUsableFileAndRemembersTheMis
 }
 
 TEST_F(AppEntryTest, PrecedenceListHoldsEveryDirectoryOnceAtItsFirstPlace) {
-  system.directories.set({.libraries = {"/home/u/Library", "/Library", "/Net/Library", "/System/Library"}});
-  const Names expected{"/System/Library/Services/",
-                       "/Library/Services/",
-                       "/home/u/Library/Services/",
-                       "/Applications/",
-                       "/OrvexInternal/Library/Services/",
-                       "/OrvexInternal/Applications/",
-                       "/Net/Library/Services/"};
-  EXPECT_EQ(service_directory_precedence(system.platform), expected);
+  EXPECT_THAT(service_directory_precedence(system.platform),
+              ElementsAre("/System/Library/Services/", "/Library/Services/", "/home/u/Library/Services/",
+                          "/Applications/", "/OrvexInternal/Library/Services/",
+                          "/OrvexInternal/Applications/", "/Network/Library/Services/"));
 }
 
 TEST_F(AppEntryTest, DirectoryThenBootVolumeThenPathLengthDecideBetweenCopies) {
-  struct Row {
-    std::string winner, loser, reason;
-    bool tie = false;  // then the receiver wins, whichever it is
-  };
+  using Row = std::tuple<std::string, std::string, std::string>;
   const std::string precedence = "directory precedence", length = "path length";
-  for (const Row& row : {
+  for (const auto& [first, second, reason] : {
            Row{"/System/Library/Services/A long name.service", "/Applications/A.app", precedence},
            Row{"/Network/Library/Services/A.service", "/x/A.app", precedence},
            Row{"/Applications/A.app", "/applications/A.app", precedence},
@@ -161,15 +142,15 @@ TEST_F(AppEntryTest, DirectoryThenBootVolumeThenPathLengthDecideBetweenCopies) {
            Row{"/Volumes.old/A.app", "/Volumes/A.app", "boot volume"},
            Row{"/Volumes/D/A.app", "/Volumes/D/Old/A.app", length},
            Row{"/x/\u20ac\u20ac.app", "/x/\U0001F600a.app", length},
-           Row{"/x/\U0001F600.app", "/x/ab.app", length, true},
        }) {
-    const auto winner = entryAt(row.winner);
-    const auto loser = entryAt(row.loser);
-    EXPECT_EQ(
-        debugLines([&] { EXPECT_TRUE(winner->shouldTakePriorityOverEntry(*loser)); }),
-        "Collision resolution: preferring " + row.winner + " to " + row.loser + " due to " + row.reason);
-    EXPECT_EQ(loser->shouldTakePriorityOverEntry(*winner), row.tie) << row.winner << " over " << row.loser;
+    const auto winner = entryAt(first);
+    const auto loser = entryAt(second);
+    EXPECT_EQ(debugLines([&] { EXPECT_TRUE(winner->shouldTakePriorityOverEntry(*loser)); }),
+              "Collision resolution: preferring " + first + " to " + second + " due to " + reason);
+    EXPECT_FALSE(loser->shouldTakePriorityOverEntry(*winner)) << second << " over " << first;
   }
+  EXPECT_TRUE(entryAt("/x/\U0001F600.app")->shouldTakePriorityOverEntry(*entryAt("/x/ab.app")));
+  EXPECT_TRUE(entryAt("/x/ab.app")->shouldTakePriorityOverEntry(*entryAt("/x/\U0001F600.app")));
 }
 
 class NormalisationTest : public AppEntryTest {
@@ -204,24 +185,20 @@ TEST_F(NormalisationTest, EveryServiceHasPathIdentifierTitlesAndAnIdentityOfItsP
 }
 
 TEST_F(NormalisationTest, KeysAreCarriedOverInTheirCanonicalFormWhenTheirValueIsOfTheRightKind) {
-  struct Row {
-    Names keys;
-    Array kept;
-    Array dropped;
-  };
+  using Row = std::tuple<Names, Array, Array>;
   const Value array(Array{"a"});
-  for (const Row& row : {
+  for (const auto& [keys, kept, dropped] : {
            Row{{"QVMessage", "QVPortName", "QVHost", "QVUserData"}, {"a", ""}, {1, array}},
            Row{{"QVSendTypes", "QVReturnTypes", "QVLanguages"}, {array}, {1, "a"}},
            Row{{"QVInputMechanism", "QVRequiredContext", "QVForbiddenContext"}, {1, "a", array}, {}},
            Row{{"QVTimeout", "QVSendFileTypes"}, {1, "a", array}, {}},
            Row{{"QVSupportsFileTranslation", "QVSupportsDataTranslation", "QVIcon"}, {}, {true, "a"}},
        }) {
-    for (const std::string& key : row.keys) {
+    for (const std::string& key : keys) {
       std::string odd = " ";
       for (const char c : key) odd.append("\t ").push_back(static_cast<char>(std::tolower(c)));
-      for (const Value& value : row.kept) EXPECT_EQ(rest({{odd, value}}), dictionary({{key, value}}));
-      for (const Value& value : row.dropped) EXPECT_EQ(rest({{key, value}}), Dictionary()) << key;
+      for (const Value& value : kept) EXPECT_EQ(rest({{odd, value}}), dictionary({{key, value}}));
+      for (const Value& value : dropped) EXPECT_EQ(rest({{key, value}}), Dictionary()) << key;
     }
   }
   EXPECT_EQ(rest({{"QVTIMEOUT", 1}, {"QVSPELLCHEC\u212AER", 2}, {"QV\nHost", "a"}, {"QVHost\u00a0", "a"}}),
@@ -288,12 +265,8 @@ TEST_F(NormalisationTest, ValueThatCannotBeHandledCostsTheRestOfTheEntryOnly) {
   const auto titled = dictionary({{"QVMenuItem", "Open"}});
   const Dictionary::Entry services{"service_dicts", Array{dictionary({}), titled}};
   const auto tables = dictionary({{"Dutch", true}, {"German", dictionary({})}});
-  struct Row {
-    Entries fields;
-    std::size_t services;
-    std::string failure;
-  };
-  for (const Row& row : {
+  using Row = std::tuple<Entries, std::size_t, std::string>;
+  for (const auto& [fields, count, failure] : {
            Row{{{"service_dicts", "x"}}, 0, "the declared services are no array"},
            Row{{{"service_dicts", Array{titled, 7, titled}}}, 1, "service 1 is no dictionary"},
            Row{{{"bundle_id", std::string(1 << 20, 'i')}, {"service_dicts", Array(20, titled)}},
@@ -304,9 +277,9 @@ TEST_F(NormalisationTest, ValueThatCannotBeHandledCostsTheRestOfTheEntryOnly) {
                1,
                "the menu strings of localization Dutch are neither a table nor false"},
        }) {
-    EXPECT_THAT(publicServices(*cached(row.fields)), SizeIs(row.services)) << row.failure;
+    EXPECT_THAT(publicServices(*cached(fields)), SizeIs(count)) << failure;
     EXPECT_THAT(system.log.take(),
-                ElementsAre("Exception processing Services at path " + path + ": " + row.failure));
+                ElementsAre("Exception processing Services at path " + path + ": " + failure));
   }
 }
 
@@ -319,11 +292,11 @@ class ValidationTest : public AppEntryTest {
     const bool valid = examined->validateEntryPlistFormatOptionallyLoggingErrors(false);
     EXPECT_THAT(system.log.take(), IsEmpty());
     EXPECT_EQ(examined->validateEntryPlistFormatOptionallyLoggingErrors(true), valid);
-    const std::vector<std::string> messages = system.log.take();
+    const Names messages = system.log.take();
     EXPECT_EQ(messages.size(), valid ? 0U : 1U);
     if (messages.empty()) return {};
     const std::string heading = "Malformed Services entries in Info.plist for Service at URL " + path;
-    EXPECT_THAT(messages[0], testing::StartsWith(heading + "\n\t"));
+    EXPECT_THAT(messages[0], StartsWith(heading + "\n\t"));
     return messages[0].substr(heading.size());
   }
   std::string problemsOfService(Entries service) {

@@ -1,24 +1,19 @@
 #include <array>
 #include <bit>
-#include <gmock/gmock.h>
 #include <random>
 
 #include "platform/property_list.h"
 #include "platform/unicode.h"
-#include "support/print.h"
+#include "support/property_lists.h"
 
 namespace kel::platform {
 namespace {
 
 using namespace std::string_literals;
+using test::dictionary;
+using test::listOf;
 using testing::HasSubstr;
 using testing::StartsWith;
-
-/// A list of `rows`, several on one line.
-template <typename T, typename... Row>
-std::vector<T> listOf(const Row&... rows) {
-  return {T(rows)...};
-}
 
 std::string number(std::uint64_t value, std::size_t size) {
   std::string bytes;
@@ -79,9 +74,9 @@ PropertyListValue randomValue(std::mt19937& random, int depth) {
     for (unsigned i = 0; i < count; ++i) array.push_back(randomValue(random, depth - 1));
     return array;
   }
-  PropertyListDictionaryBuilder dictionary;
-  for (unsigned i = 0; i < count; ++i) dictionary.set(randomText(random), randomValue(random, depth - 1));
-  return dictionary.build();
+  PropertyListDictionaryBuilder builder;
+  for (unsigned i = 0; i < count; ++i) builder.set(randomText(random), randomValue(random, depth - 1));
+  return builder.build();
 }
 
 TEST(BinaryPropertyListTest, EveryObjectIsReadAndTheSmallestFormWritten) {
@@ -108,8 +103,8 @@ TEST(BinaryPropertyListTest, EveryObjectIsReadAndTheSmallestFormWritten) {
 TEST(BinaryPropertyListTest, EverySizeOfOffsetsAndReferencesInAnyOrderIsRead) {
   for (std::size_t size = 1; size <= 8; ++size) {
     const std::string array = "\xA3" + number(0, size) + number(2, size) + number(2, size);
-    const std::string dictionary = "\xD1" + number(0, size) + number(1, size);
-    EXPECT_EQ(describe(*read(file({"\x51k", array, "\x10\7", dictionary, "junk"}, size, size, 3)).value),
+    const std::string entry = "\xD1" + number(0, size) + number(1, size);
+    EXPECT_EQ(describe(*read(file({"\x51k", array, "\x10\7", entry, "junk"}, size, size, 3)).value),
               "{\n    k = (\n        k,\n        7,\n        7\n    );\n}");
   }
   const PropertyListReading repeated = read(file({"\xD2\1\2\3\4", "\x51k", "\x51k", "\x10\1", "\x10\2"}));
@@ -205,9 +200,7 @@ TEST(BinaryPropertyListTest, EqualPartsOfOneKindAreStoredOnceAndContainersEach) 
                                     PropertyListDate{1}, PropertyListDate{1}, shared, shared}),
             file({"\xAE\1\2\3\4\1\2\3\4\5\5\6\6\7\x08", "\x10\1", "\x23\x3F\xF0\0\0\0\0\0\0"s, "\x09",
                   "\x51x", "\x41\1", "\x33\x3F\xF0\0\0\0\0\0\0"s, "\xA1\4", "\xA1\4"}));
-  EXPECT_EQ(
-      write(PropertyListDictionary(std::vector<PropertyListDictionary::Entry>{{"y", "x"}, {"x", false}})),
-      file({"\xD2\1\2\3\1", "\x51x", "\x51y", "\x08"}));
+  EXPECT_EQ(write(dictionary({{"y", "x"}, {"x", false}})), file({"\xD2\1\2\3\1", "\x51x", "\x51y", "\x08"}));
 }
 
 TEST(BinaryPropertyListTest, ReferencesAndOffsetsGrowWithTheFile) {

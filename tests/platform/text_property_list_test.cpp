@@ -1,20 +1,22 @@
 // The two encodings that people write, text and XML, and the choice among all three.
 
 #include <algorithm>
-#include <gmock/gmock.h>
 #include <limits>
 
 #include "platform/property_list.h"
-#include "support/print.h"
+#include "support/property_lists.h"
 
 namespace kel::platform {
 namespace {
 
 using namespace std::string_literals;
+using test::Array;
+using test::Dictionary;
+using test::dictionary;
+using test::listOf;
+using test::Value;
 using testing::HasSubstr;
 using testing::StartsWith;
-using Array = PropertyListArray;
-using Dictionary = PropertyListDictionary;
 using Reader = PropertyListReading (*)(BytesView bytes, const PropertyListLimits& limits);
 
 constexpr Reader text = readTextPropertyList;
@@ -24,16 +26,6 @@ constexpr double infinity = std::numeric_limits<double>::infinity();
 PropertyListReading read(Reader reader, std::string_view file, const PropertyListLimits& limits = {}) {
   // An exact copy on the heap lets the address sanitizer see a read behind the end.
   return reader(Bytes(file.begin(), file.end()), limits);
-}
-
-/// A list of `rows`, several on one line.
-template <typename T, typename... Row>
-std::vector<T> listOf(const Row&... rows) {
-  return {T(rows)...};
-}
-
-Dictionary dictionary(std::initializer_list<Dictionary::Entry> entries) {
-  return Dictionary(std::vector<Dictionary::Entry>(entries));
 }
 
 std::string utf16(std::string_view ascii, bool bigEndian) {
@@ -62,18 +54,17 @@ TEST(TextPropertyListTest, EveryFormIsRead) {
       R"((bare._/-:$09, 'b' ,a/*b*/, "", "\n\t\r\a\b\f\v\"\'\\", 'it\'s "x"', "\0\101\1018\377",
       "\U00E9\Ud83d\UDE00x", "// no /* comment)"
       "\n\u00e9\", 'a\\\nb', <>, < 0aFF\n1 2 >, (c,),\n(), {})";
-  const Array values =
-      listOf<PropertyListValue>("bare._/-:$09", "b", "a", "", "\n\t\r\a\b\f\v\"'\\", "it's \"x\"",
-                                "\0AA8\u00ff"s, "\u00e9\U0001F600x", "// no /* comment\n\u00e9", "a\nb",
-                                Bytes{}, Bytes{0x0A, 0xFF, 0x12}, Array{"c"}, Array{}, Dictionary());
-  EXPECT_EQ(read(text, strings).value, PropertyListValue(values));
-  EXPECT_EQ(read(text, "/usr/bin//comment").value, PropertyListValue("/usr/bin"));
-  EXPECT_EQ(read(text, " // nothing\n/* at\nall */").value, PropertyListValue(Dictionary()));
-  EXPECT_EQ(read(text, "x; y = (1);").value, PropertyListValue(dictionary({{"x", "x"}, {"y", Array{"1"}}})));
+  const Array values = listOf<Value>("bare._/-:$09", "b", "a", "", "\n\t\r\a\b\f\v\"'\\", "it's \"x\"",
+                                     "\0AA8\u00ff"s, "\u00e9\U0001F600x", "// no /* comment\n\u00e9", "a\nb",
+                                     Bytes{}, Bytes{0x0A, 0xFF, 0x12}, Array{"c"}, Array{}, Dictionary());
+  EXPECT_EQ(read(text, strings).value, Value(values));
+  EXPECT_EQ(read(text, "/usr/bin//comment").value, Value("/usr/bin"));
+  EXPECT_EQ(read(text, " // nothing\n/* at\nall */").value, Value(Dictionary()));
+  EXPECT_EQ(read(text, "x; y = (1);").value, Value(dictionary({{"x", "x"}, {"y", Array{"1"}}})));
   for (const std::string& file :
        listOf<std::string>("{a=b;}", "a=b;", "\xEF\xBB\xBF\"a\" /* is */ = 'b' ; // end",
                            utf16("a=b;", false), utf16("a=b;", true), "{ a = {c; d = <00>;}; 'a' = b; }"))
-    EXPECT_EQ(read(text, file).value, PropertyListValue(dictionary({{"a", "b"}}))) << file;
+    EXPECT_EQ(read(text, file).value, Value(dictionary({{"a", "b"}}))) << file;
 }
 
 TEST(TextPropertyListTest, MalformedFilesAreRefusedWithThePlace) {
@@ -95,7 +86,7 @@ TEST(XMLPropertyListTest, EveryValueIsRead) {
       "<string>1\r\n2\r3<![CDATA[\r\n4\r]]></string><string>a<![CDATA[<&lt;]]]>b<!-- c -->d<?e f?>]]</string>"
       "<array a='&amp;>' b:c = \"'\"><!-- x --><true/> <?p?><array></array></array ><array/>"
       "<dict><key>b</key><true/><key/><dict/><key>b</key><integer>2</integer></dict>";
-  const PropertyListValue values = listOf<PropertyListValue>(
+  const Value values = listOf<Value>(
       true, false, 42, -16, 7, UINT64_MAX, INT64_MIN, -125.0, 0.5, -infinity, infinity,
       PropertyListDate{730902896}, PropertyListDate{-978307200}, Bytes{0, 1, 2, 255}, Bytes{0xFB, 0xF0},
       Bytes{}, "", " a\tb ", "\u00e9\uFFFD\uE000", "<&>'\"A\U0001F600\r", "1\n2\n3\n4\n", "a<&lt;]bd]]",
@@ -108,7 +99,7 @@ TEST(XMLPropertyListTest, EveryValueIsRead) {
   EXPECT_EQ(same[0].asString(), same[1].asString()) << "repeated strings are shared";
   for (const bool bigEndian : {false, true}) {
     const std::string file = utf16("<?xml version='1.0' encoding='UTF-16'?><data/>", bigEndian);
-    EXPECT_EQ(read(xml, file).value, PropertyListValue(Bytes{}));
+    EXPECT_EQ(read(xml, file).value, Value(Bytes{}));
     EXPECT_THAT(read(xml, file.substr(0, file.size() - 1)).error, HasSubstr("says UTF-16"));
   }
 }
@@ -180,11 +171,11 @@ TEST(TextPropertyListTest, DamageNeverReadsOutOfBounds) {
 }
 
 TEST(PropertyListDescriptionTest, AValueIsRenderedInTheTextEncoding) {
-  const PropertyListValue nested = dictionary({{"a b", Array{1, Array{}, Dictionary()}}, {"c", "x"}});
+  const Value nested = dictionary({{"a b", Array{1, Array{}, Dictionary()}}, {"c", "x"}});
   EXPECT_EQ(
       describe(nested),
       "{\n    \"a b\" = (\n        1,\n        (\n        ),\n        {\n        }\n    );\n    c = x;\n}");
-  const Array values = listOf<PropertyListValue>(
+  const Array values = listOf<Value>(
       true, false, UINT64_MAX, INT64_MIN, 0.1, 1e300, -2.0, infinity, Bytes{0x01, 0x23, 0xAB, 0xCD, 0xEF},
       PropertyListDate{730902896.75}, PropertyListDate{-1}, PropertyListDate{-63113904000},
       PropertyListDate{1e300}, "", "a//b", "/a.b:c-d_e$", "a b", "\"\\\n\x1b\x7f\u0080\u00e9\U0001F600\xFF");
@@ -196,7 +187,7 @@ TEST(PropertyListDescriptionTest, AValueIsRenderedInTheTextEncoding) {
                           "\u00e9\U0001F600\uFFFD\"");
   for (std::size_t i = 0; i < values.size(); ++i) EXPECT_EQ(describe(values[i]), texts.at(i));
 
-  PropertyListValue deep = Array(50'000, PropertyListValue("\u00e9"));
+  Value deep = Array(50'000, Value("\u00e9"));
   for (int level = 0; level < 500; ++level) deep = Array{deep};
   EXPECT_EQ(describeBriefly(deep, 4096).size(), 4096 + std::string_view(" [cut]").size());
   EXPECT_EQ(describeBriefly("\u00e9", 2), "\" [cut]") << "cut within a character";
@@ -207,10 +198,10 @@ TEST(PropertyListReaderTest, TheEncodingIsFoundByTheBeginning) {
            " \n<!-- c --><true/>", "<true/>", "<?xml version='1.0'?><true/>", "<!DOCTYPE plist><true/>",
            utf16("<true/>", false),
            "bplist00\x09\x08\0\0\0\0\0\0\1\1\0\0\0\0\0\0\0\1\0\0\0\0\0\0\0\0\0\0\0\0\0\0\0\x09"s))
-    EXPECT_EQ(read(readPropertyList, file).value, PropertyListValue(true)) << file;
-  EXPECT_EQ(read(readPropertyList, " <ab cd>").value, PropertyListValue(Bytes{0xAB, 0xCD}));
-  EXPECT_EQ(read(readPropertyList, "<abcdef>").value, PropertyListValue(Bytes{0xAB, 0xCD, 0xEF}));
-  EXPECT_EQ(read(readPropertyList, "bplist").value, PropertyListValue("bplist"));
+    EXPECT_EQ(read(readPropertyList, file).value, Value(true)) << file;
+  EXPECT_EQ(read(readPropertyList, " <ab cd>").value, Value(Bytes{0xAB, 0xCD}));
+  EXPECT_EQ(read(readPropertyList, "<abcdef>").value, Value(Bytes{0xAB, 0xCD, 0xEF}));
+  EXPECT_EQ(read(readPropertyList, "bplist").value, Value("bplist"));
 }
 
 }  // namespace

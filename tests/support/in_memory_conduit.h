@@ -1,17 +1,16 @@
 #pragma once
 
-#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <stdexcept>
 #include <string_view>
 #include <utility>
 #include <variant>
-#include <vector>
 
 #include "platform/conduit.h"
 #include "platform/guarded.h"
@@ -63,10 +62,9 @@ class InMemoryMessage : public platform::ConduitMessage {
 /// Endpoints within the process: a connection's messages reach the listener on the listener's queue.
 class InMemoryConduit : public platform::Conduit {
  public:
-  void trackActivity() override { tracksActivity = true; }
+  void trackActivity() override {}
   platform::ConduitListening listen(std::string_view, platform::SerialQueue& queue,
                                     platform::ConduitEventHandler handler) override {
-    if (endpoint_.copy()) return {nullptr, true, "another server holds the endpoint"};
     endpoint_.set(std::make_shared<Endpoint>(Endpoint{queue, std::move(handler)}));
     return {std::make_unique<Listener>(*this), false, {}};
   }
@@ -81,7 +79,6 @@ class InMemoryConduit : public platform::Conduit {
     endpoint->queue.sync([&] { endpoint->handler(event); });
   }
 
-  bool tracksActivity = false;
   std::int64_t nextPeer = 4711;  ///< process id of the next connection's peer
   std::atomic<int> connections = 0;
 
@@ -144,17 +141,11 @@ class InMemoryConduit : public platform::Conduit {
   platform::Guarded<std::shared_ptr<Endpoint>> endpoint_;
 };
 
-/// Knows the sandboxed processes by id; for the ids in `failing` the question fails.
+/// Answers by process id; a process of no answer is not sandboxed.
 class InMemorySandbox : public platform::SandboxQuery {
  public:
-  int check(const platform::PeerProcess& process) override {
-    const auto in = [id = process.processID()](const std::vector<std::int64_t>& ids) {
-      return std::find(ids.begin(), ids.end(), id) != ids.end();
-    };
-    return in(failing) ? -1 : in(sandboxed) ? 1 : 0;
-  }
-  std::vector<std::int64_t> sandboxed;
-  std::vector<std::int64_t> failing;
+  int check(const platform::PeerProcess& process) override { return answers[process.processID()]; }
+  std::map<std::int64_t, int> answers;
 };
 
 }  // namespace kel::test

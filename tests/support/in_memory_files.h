@@ -71,9 +71,6 @@ class InMemoryFileSystem : public platform::FileSystem {
   void addPropertyList(const std::string& path, const platform::PropertyListValue& value) {
     addFile(path, platform::writeBinaryPropertyList(value).bytes.value());
   }
-  void addDirectory(const std::string& path) {
-    state_.with([&](State& state) { state.put(path, std::nullopt); });
-  }
   void removeTree(const std::string& path) {
     state_.with([&](State& state) {
       std::erase_if(state.nodes, [prefix = path + "/"](const auto& node) {

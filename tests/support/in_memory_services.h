@@ -56,22 +56,17 @@ class RecordingLog : public platform::SystemLog {
   platform::Guarded<std::vector<std::string>> messages_;
 };
 
-/// Keeps every publication; the last one is the preference that other processes read. Any thread.
+/// Keeps the last publication: it is the preference that other processes read. Any thread.
 class InMemoryPublication : public platform::ServicesPublication, public platform::Preferences {
  public:
-  void publish(const platform::PropertyListValue& publication) override {
-    publications_.with([&](auto& publications) { publications.push_back(publication); });
-  }
+  void publish(const platform::PropertyListValue& publication) override { last_.set(publication); }
   std::optional<platform::PropertyListValue> value(std::string_view domain, std::string_view key) override {
-    const std::vector<platform::PropertyListValue> all = publications();
     const bool own = domain == "com.orvex.ServicesMenu.Services" && key == "QVServices";
-    return own && !all.empty() ? std::optional(all.back()) : std::nullopt;
+    return own ? last_.copy() : std::nullopt;
   }
-
-  std::vector<platform::PropertyListValue> publications() const { return publications_.copy(); }
 
  private:
-  platform::Guarded<std::vector<platform::PropertyListValue>> publications_;
+  platform::Guarded<std::optional<platform::PropertyListValue>> last_;
 };
 
 class CountingTransactions : public platform::Transactions {
@@ -101,8 +96,6 @@ class InMemorySeeds : public platform::NotificationSeeds {
     return nullptr;
   }
 
-  std::uint64_t stateOf(const std::string& name) { return state(registerName(name)); }
-  void setStateOf(const std::string& name, std::uint64_t state) { setState(registerName(name), state); }
   std::size_t postsOf(const std::string& name) {
     return seeds_.with([&](auto& seeds) { return seeds[registerName(name)].posts; });
   }
@@ -121,16 +114,11 @@ class InMemoryLaunchEvents : public platform::LaunchEvents {
   void setHandler(std::string_view stream, platform::SerialQueue& queue,
                   std::function<void()> handler) override {
     streams.emplace_back(stream);
-    handlers_[streams.back()] = [&queue, handler = std::move(handler)] { queue.async(handler); };
+    fire[streams.back()] = [&queue, handler = std::move(handler)] { queue.async(handler); };
   }
 
-  /// Queues the stream's handler.
-  void fire(const std::string& stream) { handlers_.at(stream)(); }
-
-  std::vector<std::string> streams;  ///< in the order of their handlers
-
- private:
-  std::map<std::string, std::function<void()>> handlers_;
+  std::vector<std::string> streams;                   ///< in the order of their handlers
+  std::map<std::string, std::function<void()>> fire;  ///< queues the stream's handler
 };
 
 /// Applications that provide services.
@@ -139,15 +127,11 @@ class InMemoryRegistry : public platform::ApplicationRegistry {
   std::vector<platform::RegisteredApplication> applications(std::uint32_t mask,
                                                             std::uint32_t value) override {
     ++queries;
-    if ((mask & value) != providesServices) return {};
-    return registered_;
+    return mask & value & providesServices ? registered : std::vector<platform::RegisteredApplication>();
   }
-  void add(const std::string& path) { registered_.push_back({path}); }
 
+  std::vector<platform::RegisteredApplication> registered;
   std::atomic<std::size_t> queries = 0;
-
- private:
-  std::vector<platform::RegisteredApplication> registered_;
 };
 
 /// A journal in memory: replays what was recorded, and misbehaves on demand. One test thread arranges it.
@@ -160,7 +144,15 @@ class InMemoryJournal : public platform::EventJournal {
                                                         std::uint32_t flags) override {
     creations.push_back({since, flags});
     if (!available || (refuseWatchRoot && (flags & platform::stream_flags::watchRoot))) return nullptr;
-    return std::make_unique<Stream>(*this, std::move(callback), paths, since);
+    std::vector<platform::JournalEvent> batch;
+    for (const platform::JournalEvent& event : events_) {
+      const bool watched = std::any_of(paths.begin(), paths.end(), [&](const std::string& path) {
+        return event.path.starts_with(path) || path.starts_with(event.path);
+      });
+      if (event.eventID > since && watched) batch.push_back(event);
+    }
+    if (historyEnds) batch.push_back({"", platform::event_flags::historyDone, newest_});
+    return std::make_unique<Stream>(*this, std::move(callback), std::move(batch));
   }
 
   /// Records an event at the next position.
@@ -183,9 +175,9 @@ class InMemoryJournal : public platform::EventJournal {
  private:
   class Stream : public platform::JournalStream {
    public:
-    Stream(InMemoryJournal& journal, platform::JournalCallback callback, std::vector<std::string> paths,
-           platform::EventID since)
-        : journal_(journal), callback_(std::move(callback)), paths_(std::move(paths)), since_(since) {
+    Stream(InMemoryJournal& journal, platform::JournalCallback callback,
+           std::vector<platform::JournalEvent> batch)
+        : journal_(journal), callback_(std::move(callback)), batch_(std::move(batch)) {
       ++journal_.liveStreams;
     }
     ~Stream() override { --journal_.liveStreams; }
@@ -193,15 +185,7 @@ class InMemoryJournal : public platform::EventJournal {
     void setQueue(platform::SerialQueue& queue) override { queue_ = &queue; }
     bool start() override {
       if (journal_.refuseStart) return false;
-      std::vector<platform::JournalEvent> batch;
-      for (const platform::JournalEvent& event : journal_.events_) {
-        const bool watched = std::any_of(paths_.begin(), paths_.end(), [&](const std::string& path) {
-          return event.path.starts_with(path) || path.starts_with(event.path);
-        });
-        if (event.eventID > since_ && watched) batch.push_back(event);
-      }
-      if (journal_.historyEnds) batch.push_back({"", platform::event_flags::historyDone, journal_.newest_});
-      queue_->async([callback = callback_, batch] { callback(batch); });
+      queue_->async([callback = callback_, batch = batch_] { callback(batch); });
       if (!journal_.afterHistory.empty()) {
         queue_->async([callback = callback_, later = journal_.afterHistory] { callback(later); });
       }
@@ -212,9 +196,8 @@ class InMemoryJournal : public platform::EventJournal {
 
    private:
     InMemoryJournal& journal_;
-    platform::JournalCallback callback_;
-    std::vector<std::string> paths_;
-    platform::EventID since_;
+    const platform::JournalCallback callback_;
+    const std::vector<platform::JournalEvent> batch_;
     platform::SerialQueue* queue_ = nullptr;
   };
 
@@ -225,15 +208,13 @@ class InMemoryJournal : public platform::EventJournal {
 /// A process whose main loop runs a test's work and then returns.
 class InMemoryProcess : public platform::Process {
  public:
-  void onTermination(platform::Task handler) override { termination = std::move(handler); }
-  void exitNow(int status) override { exitStatus = status; }
+  void onTermination(platform::Task) override {}
+  void exitNow(int) override {}
   void runMainLoop() override {
     if (mainLoop) mainLoop();
   }
 
-  platform::Task termination;
   platform::Task mainLoop;
-  std::optional<int> exitStatus;
 };
 
 }  // namespace kel::test

@@ -1,10 +1,12 @@
 #pragma once
 
+#include <atomic>
 #include <condition_variable>
 #include <cstddef>
 #include <map>
 #include <mutex>
 #include <utility>
+#include <vector>
 
 #include "platform/clock.h"
 
@@ -12,35 +14,71 @@ namespace kel::test {
 
 /// A clock whose time passes only when a test says so. Any thread.
 class ManualClock : public platform::Clock {
- public:
-  explicit ManualClock(double wallClockSeconds = 0) : wallClock_(wallClockSeconds) {}
+  using Duration = std::chrono::nanoseconds;
+  using Timer = std::pair<platform::SerialQueue*, platform::Task>;
 
+ public:
   /// Lets `duration` pass: timers that fall due are queued on their queues in the order of their deadlines,
   /// waits whose time is over end. The wall clock moves along. A queued task that sets a timer in turn sets
   /// it at the new time.
-  void advance(std::chrono::nanoseconds duration);
-
-  /// Sets the wall clock, and nothing else.
-  void setWallClock(double seconds);
+  void advance(Duration duration) {
+    std::vector<Timer> due;
+    {
+      const std::lock_guard lock(mutex_);
+      now_ += duration;
+      wallClock = wallClock + std::chrono::duration<double>(duration).count();
+      const auto end = timers_.upper_bound(now_);
+      for (auto timer = timers_.begin(); timer != end; ++timer) due.push_back(std::move(timer->second));
+      timers_.erase(timers_.begin(), end);
+      // Under the lock, without which no waiter can leave and destroy its semaphore.
+      for (auto wait = waits_.begin(); wait != waits_.upper_bound(now_); ++wait) wait->second->poke();
+    }
+    for (auto& [queue, task] : due) queue->async(std::move(task));
+  }
 
   /// Wait, in real time with a generous limit, until at least `count` timers or timed waits are pending;
   /// false when the limit passed.
-  [[nodiscard]] bool awaitTimers(std::size_t count);
-  [[nodiscard]] bool awaitWaits(std::size_t count);
+  [[nodiscard]] bool awaitTimers(std::size_t count) { return awaitPending(timers_, count); }
+  [[nodiscard]] bool awaitWaits(std::size_t count) { return awaitPending(waits_, count); }
 
-  double wallClockSeconds() const override;
-  void after(platform::SerialQueue& queue, std::chrono::nanoseconds delay, platform::Task task) override;
-  bool wait(platform::Semaphore& semaphore, std::chrono::nanoseconds timeout) override;
+  double wallClockSeconds() const override { return wallClock; }
+  void after(platform::SerialQueue& queue, Duration delay, platform::Task task) override {
+    if (delay <= Duration::zero()) return queue.async(std::move(task));
+    const std::lock_guard lock(mutex_);
+    timers_.emplace(deadlineAfter(delay), Timer(&queue, std::move(task)));
+    changed_.notify_all();
+  }
+  bool wait(platform::Semaphore& semaphore, Duration timeout) override {
+    std::unique_lock lock(mutex_);
+    const Duration deadline = deadlineAfter(timeout);
+    const auto registered = waits_.emplace(deadline, &semaphore);
+    changed_.notify_all();
+    lock.unlock();
+    const bool taken = semaphore.waitUnless([&] {
+      const std::lock_guard expiry(mutex_);
+      return now_ >= deadline;
+    });
+    lock.lock();
+    waits_.erase(registered);
+    return taken;
+  }
+
+  std::atomic<double> wallClock = 0;
 
  private:
-  using Timer = std::pair<platform::SerialQueue*, platform::Task>;
+  Duration deadlineAfter(Duration delay) const {
+    return delay > Duration::max() - now_ ? Duration::max() : now_ + delay;
+  }
+  bool awaitPending(const auto& pending, std::size_t count) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, std::chrono::seconds(30), [&] { return pending.size() >= count; });
+  }
 
-  mutable std::mutex mutex_;
+  std::mutex mutex_;
   std::condition_variable changed_;
-  std::chrono::nanoseconds now_{0};
-  double wallClock_;
-  std::multimap<std::chrono::nanoseconds, Timer> timers_;                // by deadline
-  std::multimap<std::chrono::nanoseconds, platform::Semaphore*> waits_;  // by deadline
+  Duration now_{0};
+  std::multimap<Duration, Timer> timers_;                // by deadline
+  std::multimap<Duration, platform::Semaphore*> waits_;  // by deadline
 };
 
 }  // namespace kel::test
