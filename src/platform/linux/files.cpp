@@ -56,7 +56,9 @@ std::optional<Bytes> readFile(int directory, const std::string& path, std::size_
   if (!file || !isRegularFile(file.get(), status)) return std::nullopt;
   const auto size = static_cast<std::size_t>(status.st_size);
   std::size_t length = 0;
-  Bytes bytes(std::min(size, largest) + 1);
+  // What states no size is the system's, and some of that is given in one piece or not at all.
+  constexpr std::size_t piece = 4096;
+  Bytes bytes(std::min(size > 0 ? size : piece, largest) + 1);
   while (size <= largest && length <= largest) {
     const ssize_t count = read(file.get(), bytes.data() + length, bytes.size() - length);
     if (count < 0 && errno == EINTR) continue;
