@@ -15,12 +15,14 @@ namespace kel::platform {
 
 namespace {
 
-/// Local file systems, on which whatever is changed is changed through this kernel and told.
+/// Local file systems, on which whatever is changed is changed through this kernel, told, and stamped in the
+/// directory, too. Those of removable media are none: other machines change them, and their roots bear no
+/// stamps.
 bool notifiesOfEveryChange(std::uint64_t magic) {
   static constexpr std::uint64_t local[] = {
-      EXT4_SUPER_MAGIC,     XFS_SUPER_MAGIC,   BTRFS_SUPER_MAGIC,    TMPFS_MAGIC,
-      F2FS_SUPER_MAGIC,     RAMFS_MAGIC,       0x2fc12fc1 /* ZFS */, 0xca451a4e /* bcachefs */,
-      REISERFS_SUPER_MAGIC, MSDOS_SUPER_MAGIC, 0x3153464a /* JFS */, 0x2011bab0 /* exFAT */};
+      EXT4_SUPER_MAGIC,     XFS_SUPER_MAGIC, BTRFS_SUPER_MAGIC,    TMPFS_MAGIC,
+      F2FS_SUPER_MAGIC,     RAMFS_MAGIC,     0x2fc12fc1 /* ZFS */, 0xca451a4e /* bcachefs */,
+      REISERFS_SUPER_MAGIC, 0x3153464a /* JFS */};
   return std::find(std::begin(local), std::end(local), magic) != std::end(local);
 }
 

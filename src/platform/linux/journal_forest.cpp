@@ -82,6 +82,7 @@ bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode 
     }
   }
   if (nodes.empty()) return false;
+  isAsked_ = mode == LookMode::InParallel;
   LookSettings settings;
   settings.watchMask = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_MODIFY | IN_CLOSE_WRITE |
                        IN_ATTRIB | IN_DELETE_SELF | IN_MOVE_SELF | IN_EXCL_UNLINK | IN_MASK_ADD;

@@ -134,6 +134,7 @@ class JournalForest {
   std::unordered_set<JournalNode*> unsettled_;
   std::unordered_set<const JournalNode*> releasedInBatch_;
   Hints hints_;
+  bool isAsked_ = false;  // the looks are for a question
   bool exhaustionReported_ = false;
   bool overflowReported_ = false;
   bool sizeReported_ = false;

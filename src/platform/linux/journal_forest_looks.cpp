@@ -29,7 +29,7 @@ void JournalForest::install(DirectoryLook& look, EventID id) {
   if (look.hasRecord) {
     const bool led = node.record.leadsToDirectory() && node.record.target.inode == look.record.target.inode;
     installRecord(node, std::move(look.record), isDoubted || !isCovered(*node.parent), id);
-    if (node.isBoundless) JournalTree::markChanged(node, id);
+    if (node.isBoundless && isAsked_) JournalTree::markChanged(node, id);
     if (!led) return;  // what it leads to now has been queued
   }
   if (look.isListing && node.directory) installListing(look, isDoubted, id);
@@ -92,7 +92,7 @@ void JournalForest::installListing(DirectoryLook& look, bool isDoubted, EventID 
   const bool wasKnown = isChanged || before.kind != EntryKind::Unknown;
   if (isDoubted && wasKnown && node.latest != latest) hint(*node.tree);
   directory.listing = look.own;
-  directory.listingIsSound = !look.ownIsRacy;
+  directory.listingIsSound = !look.ownIsRacy && look.fileSystem.notifies;
   directory.fileSystem = look.fileSystem.identity;
   directory.notifies = look.fileSystem.notifies;
   directory.error = 0;
@@ -111,7 +111,7 @@ void JournalForest::installFailure(DirectoryLook& look, EventID id) {
   // Where one cannot look everything may have changed, whenever it is asked about.
   const bool wasThere = directory.error == 0 && directory.listing.kind != EntryKind::Unknown;
   const bool isMissingRoot = !node.parent && meansMissing(look.error);
-  if (wasThere || directory.error != look.error || !meansMissing(look.error)) {
+  if (wasThere || directory.error != look.error || (!meansMissing(look.error) && isAsked_)) {
     const bool isFirstLook = isMissingRoot && directory.error == 0 && !wasThere;
     if (!isFirstLook) JournalTree::markChanged(node, id);
     if (!isFirstLook && directory.error != look.error) hint(*node.tree);

@@ -85,6 +85,19 @@ TEST_F(JournalKeeperTest, WhatIsAsBeforeTheIndexIsNotTakenForWhatAPositionSaw) {
   }
 }
 
+TEST_F(JournalKeeperTest, WhatCanNeverBeToldIsToldWhenAskedButNotWrittenAgainAndAgain) {
+  fs::create_directory_symlink("/", root + "/everything");
+  open();
+  position = keeper->currentEventID();
+  EXPECT_EQ(told(), "/everything/ ");
+  keeper->indexFile();
+  keeper->questionUncovered();
+  while (keeper->lookInBackground()) {
+  }
+  EXPECT_FALSE(keeper->needsSaving());
+  EXPECT_EQ(told(), "/everything/ ");
+}
+
 TEST_F(JournalKeeperTest, ADirectoryThatGrowsBeyondTheLimitIsNotRemembered) {
   options.limits.mostEntries = 100;
   options.limits.mostVanished = 10;
