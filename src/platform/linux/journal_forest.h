@@ -138,6 +138,8 @@ class JournalForest {
   bool exhaustionReported_ = false;
   bool overflowReported_ = false;
   bool sizeReported_ = false;
+  bool unreadableReported_ = false;
+  bool boundlessReported_ = false;
 };
 
 }  // namespace kel::platform

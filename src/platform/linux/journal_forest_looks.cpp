@@ -18,6 +18,9 @@ std::size_t countBelow(const JournalNode& node, std::size_t most) {
   return count;
 }
 
+/// What becomes of the first of its kind, for the system log.
+constexpr const char* unknowable = "; such entries count as changed whenever they are asked about";
+
 /// True when the path leads nowhere, as opposed to where one cannot look.
 bool meansMissing(int error) { return error == ENOENT || error == ENOTDIR; }
 
@@ -116,6 +119,9 @@ void JournalForest::installFailure(DirectoryLook& look, EventID id) {
     if (!isFirstLook) JournalTree::markChanged(node, id);
     if (!isFirstLook && directory.error != look.error) hint(*node.tree);
   }
+  if (!meansMissing(look.error)) {
+    reportOnce(unreadableReported_, errorLine(node.tree->pathOf(node), look.error) + unknowable);
+  }
   releaseBelow(node);
   directory.listing = {};
   directory.listingIsSound = false;
@@ -156,6 +162,7 @@ void JournalForest::enforceLimits(JournalNode& directory) {
   if (link && countBelow(*link, limits_.mostBehindLink) > limits_.mostBehindLink) {
     becomeEmptyDirectory(*link);
     link->isBoundless = true;
+    reportOnce(boundlessReported_, tree.pathOf(*link) + ": leads to too much" + unknowable);
     updateCover(*link);
   }
   if (tree.nodeCount > limits_.mostEntries) noteTooLarge(tree);

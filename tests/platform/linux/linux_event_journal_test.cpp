@@ -144,6 +144,7 @@ TEST_P(EventJournalTest, HostileTreesCostABoundedLook) {
   scratch.write("Services/b.service/\xff\xfe", "nor this");
   EXPECT_THAT(replay(start, {root + "b.service"}), ElementsAre("b.service/."));
   EXPECT_THAT(replay(start), Contains("a.service/everything/"));  // more than is worth looking at
+  EXPECT_THAT(log.take(), ElementsAre(testing::HasSubstr("leads to too much")));
 }
 
 TEST_P(EventJournalTest, ADirectoryOfAHundredThousandEntriesOnAnotherFileSystemBehindALink) {
