@@ -100,7 +100,6 @@ void JournalService::subscribe(std::shared_ptr<JournalSubscription> subscription
         keeper_.eventsSince(subscription->position(), subscription->paths(), subscription->watchesRoot());
     events.push_back({{}, event_flags::historyDone, keeper_.lastID()});
     if (JournalSubscription::deliver(subscription, std::move(events), keeper_.lastID())) {
-      std::erase_if(subscriptions_, [](const auto& entry) { return entry.expired(); });
       subscriptions_.push_back(subscription);
     }
     finishRound();
