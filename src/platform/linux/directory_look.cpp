@@ -46,7 +46,7 @@ class Listing {
     // Watched first, listed second: what changes in between is told by the watch.
     if (settings_.inotify >= 0) {
       const std::uint32_t mask = settings_.watchMask | IN_ONLYDIR | (followsLinks ? 0u : IN_DONT_FOLLOW);
-      const bool mayWatch = settings_.mayAddWatches || node.directory->watch >= 0;
+      const bool mayWatch = node.directory->watch >= 0 || settings_.watchesLeft->fetch_sub(1) > 0;
       if (mayWatch) look_.watch = inotify_add_watch(settings_.inotify, path.c_str(), mask);
       if (look_.watch < 0) look_.watchError = mayWatch ? errno : ENOSPC;
     }

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <cstddef>
 #include <string>
@@ -48,8 +49,8 @@ struct DirectoryLook {
 struct LookSettings {
   int inotify = -1;  ///< -1: without a watch
   std::uint32_t watchMask = 0;
-  bool mayAddWatches = true;  ///< else only directories that have one are watched again
-  bool alwaysDigest = false;  ///< also where changes are told by watches
+  std::atomic<std::int64_t>* watchesLeft = nullptr;  ///< for directories that have none yet; with `inotify`
+  bool alwaysDigest = false;                         ///< also where changes are told by watches
   std::size_t mostEntries = 0;
   std::chrono::steady_clock::time_point deadline = std::chrono::steady_clock::time_point::max();
 };

@@ -87,7 +87,9 @@ bool JournalForest::lookAtSome(const std::vector<JournalTree*>& trees, LookMode 
   settings.watchMask = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_MODIFY | IN_CLOSE_WRITE |
                        IN_ATTRIB | IN_DELETE_SELF | IN_MOVE_SELF | IN_EXCL_UNLINK | IN_MASK_ADD;
   settings.inotify = inotify_.get();
-  settings.mayAddWatches = watches_.size() + batch <= limits_.mostWatches;
+  std::atomic<std::int64_t> watchesLeft =
+      static_cast<std::int64_t>(limits_.mostWatches) - static_cast<std::int64_t>(watches_.size());
+  settings.watchesLeft = &watchesLeft;
   settings.alwaysDigest = !inotify_ || mode == LookMode::ForGood;
   settings.mostEntries = limits_.mostEntries;
   settings.deadline = deadline;

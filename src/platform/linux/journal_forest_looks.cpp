@@ -12,7 +12,7 @@ std::size_t countBelow(const JournalNode& node, std::size_t most) {
   std::size_t count = 0;
   if (!node.directory) return count;
   for (const auto& [name, child] : node.directory->children) {
-    count += 1 + countBelow(*child, most);
+    count += (child->isGone ? 0 : 1) + countBelow(*child, most);
     if (count > most) break;
   }
   return count;
@@ -162,6 +162,8 @@ void JournalForest::enforceLimits(JournalNode& directory) {
   if (link && countBelow(*link, limits_.mostBehindLink) > limits_.mostBehindLink) {
     becomeEmptyDirectory(*link);
     link->isBoundless = true;
+    // What was just found below it is forgotten before it could be told.
+    JournalTree::markChanged(*link, newID_());
     reportOnce(boundlessReported_, tree.pathOf(*link) + ": leads to too much" + unknowable);
     updateCover(*link);
   }

@@ -17,7 +17,6 @@ enum Flag : unsigned {
   isKnown = 0x1,
   isRacy = 0x2,
   isGone = 0x4,
-  isBoundless = 0x8,
   isSound = 0x10,
 };
 
@@ -31,7 +30,6 @@ class TreeWriter {
     const bool known = record.isKnown && !(record.isRacy && !record.digest);
     const JournalDirectory* directory = node.directory.get();
     writer_.number((known ? isKnown : 0u) | (record.isRacy ? isRacy : 0u) | (node.isGone ? isGone : 0u) |
-                   (node.isBoundless ? isBoundless : 0u) |
                    (directory && directory->listingIsSound ? isSound : 0u));
     writeStatus(writer_, record.status);
     if (record.isLink()) writeStatus(writer_, record.target);
@@ -77,7 +75,6 @@ class TreeReader {
     const bool isPossible = node.parent || (record.isDirectory() && (flags & isGone) == 0);
     if (depth > deepest || !isPossible) return reader_.fail();
     node.record = std::move(record);
-    node.isBoundless = (flags & isBoundless) != 0;
     if (flags & isGone) {
       node.isGone = true;
       ++node.tree->vanishedCount;

@@ -85,6 +85,23 @@ TEST_F(JournalKeeperTest, WhatIsAsBeforeTheIndexIsNotTakenForWhatAPositionSaw) {
   }
 }
 
+TEST_F(JournalKeeperTest, ALinkWhoseTargetOutgrowsTheLimitIsToldAtOnceAndIsFollowedAgainByTheNextProcess) {
+  options.directory = scratch / "state";
+  options.limits.mostBehindLink = 10;
+  scratch.write("target/file");
+  fs::create_directory_symlink(scratch / "target", root + "/link");
+  open();
+  position = keeper->currentEventID();
+  for (int index = 0; index < 20; ++index) scratch.write("target/" + std::to_string(index));
+  EXPECT_EQ(told(), "/link/ ");
+  for (int index = 0; index < 20; ++index) fs::remove(scratch / "target/" + std::to_string(index));
+  ASSERT_FALSE(files.writeAtomically(keeper->indexPath(), keeper->indexFile()));
+  open();
+  keeper->currentEventID();
+  position = keeper->currentEventID();
+  EXPECT_EQ(told(), "");
+}
+
 TEST_F(JournalKeeperTest, WhatCanNeverBeToldIsToldWhenAskedButNotWrittenAgainAndAgain) {
   fs::create_directory_symlink("/", root + "/everything");
   open();
