@@ -18,9 +18,9 @@
 #include <unistd.h>
 #include <vector>
 
-#include "platform/linux/files.h"
-#include "platform/linux/linux_event_journal.h"
-#include "platform/linux/linux_file_system.h"
+#include "platform/linux/files/files.h"
+#include "platform/linux/files/linux_file_system.h"
+#include "platform/linux/journal/linux_event_journal.h"
 
 namespace {
 

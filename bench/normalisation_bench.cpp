@@ -8,7 +8,7 @@
 
 #include "entries/app_entry.h"
 #include "platform/linux/linux_platform.h"
-#include "platform/property_list.h"
+#include "property_lists/property_list.h"
 
 namespace {
 

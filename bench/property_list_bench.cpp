@@ -1,7 +1,7 @@
 // Reads and writes values that resemble information dictionaries; throughput is in bytes of the encoding.
 #include <benchmark/benchmark.h>
 
-#include "platform/property_list.h"
+#include "property_lists/property_list.h"
 
 namespace kel::platform {
 namespace {

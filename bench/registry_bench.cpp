@@ -10,9 +10,9 @@
 #include <thread>
 #include <vector>
 
-#include "platform/linux/linux_application_registry.h"
-#include "platform/linux/linux_file_system.h"
-#include "platform/linux/linux_system_log.h"
+#include "platform/linux/files/linux_file_system.h"
+#include "platform/linux/process/linux_system_log.h"
+#include "platform/linux/registry/linux_application_registry.h"
 
 namespace {
 

@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/conduit_frames.h"
+#include "platform/linux/conduit/conduit_frames.h"
 
 namespace {
 

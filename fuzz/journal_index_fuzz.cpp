@@ -1,4 +1,4 @@
-#include "platform/linux/journal_index.h"
+#include "platform/linux/journal/journal_index.h"
 #include "sealed_check.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {

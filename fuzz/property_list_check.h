@@ -2,7 +2,7 @@
 
 #include <cstdlib>
 
-#include "platform/property_list.h"
+#include "property_lists/property_list.h"
 
 namespace kel::platform {
 

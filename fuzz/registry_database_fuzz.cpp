@@ -1,4 +1,4 @@
-#include "platform/linux/application_database.h"
+#include "platform/linux/registry/application_database.h"
 #include "sealed_check.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {

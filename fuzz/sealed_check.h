@@ -7,7 +7,7 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/linux/sealed_bytes.h"
+#include "platform/linux/files/sealed_bytes.h"
 
 /// Reads `input`, as a whole file and as the payload of one of `format`, and writes what was read: that must
 /// be accepted and come out as it is. `rewrite` does both; absent when the file is refused.

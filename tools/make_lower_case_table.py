@@ -1,7 +1,7 @@
 #!/usr/bin/env python3
-"""Writes src/platform/unicode_lower_case_table.inc from this Python's Unicode character database.
+"""Writes src/property_lists/unicode_lower_case_table.inc from this Python's Unicode character database.
 
-Usage: tools/make_lower_case_table.py > src/platform/unicode_lower_case_table.inc
+Usage: tools/make_lower_case_table.py > src/property_lists/unicode_lower_case_table.inc
 """
 import sys
 import unicodedata

@@ -4,7 +4,7 @@
 #include <set>
 
 #include "common/common.h"
-#include "platform/unicode.h"
+#include "property_lists/unicode.h"
 #include "restrictions/whitelist_generator.h"
 
 namespace kel {

@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "client/request_protocol.h"
+#include "protocol/request_protocol.h"
 
 namespace kel {
 

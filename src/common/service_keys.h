@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/property_list_value.h"
+#include "property_lists/property_list_value.h"
 
 /// Keys of service dictionaries. Each is one shared string, so that storing a value under it copies a
 /// reference and a list of many services holds each key once.

@@ -4,7 +4,7 @@
 #include <utility>
 
 #include "common/debug_sink.h"
-#include "platform/unicode.h"
+#include "property_lists/unicode.h"
 
 namespace kel {
 

@@ -8,10 +8,10 @@
 
 #include "entries/app_entry_validation.h"
 #include "platform/bundles.h"
-#include "platform/digest.h"
 #include "platform/guarded.h"
 #include "platform/platform.h"
-#include "platform/property_list_value.h"
+#include "property_lists/digest.h"
+#include "property_lists/property_list_value.h"
 
 namespace kel {
 

@@ -2,7 +2,7 @@
 
 #include "common/common.h"
 #include "entries/app_entry.h"
-#include "platform/unicode.h"
+#include "property_lists/unicode.h"
 
 namespace kel {
 

@@ -6,7 +6,7 @@
 
 #include "common/service_keys.h"
 #include "entries/app_entry.h"
-#include "platform/unicode.h"
+#include "property_lists/unicode.h"
 
 namespace kel {
 

@@ -4,7 +4,7 @@
 #include <array>
 
 #include "entries/app_entry.h"
-#include "platform/unicode.h"
+#include "property_lists/unicode.h"
 
 namespace kel {
 

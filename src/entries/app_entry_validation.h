@@ -6,7 +6,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/property_list_value.h"
+#include "property_lists/property_list_value.h"
 
 namespace kel {
 

@@ -7,8 +7,8 @@
 #include <string_view>
 #include <variant>
 
-#include "platform/property_list_value.h"
 #include "platform/work_queue.h"
+#include "property_lists/property_list_value.h"
 
 namespace kel::platform {
 

@@ -5,8 +5,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/bytes.h"
-#include "platform/property_list.h"
+#include "property_lists/bytes.h"
+#include "property_lists/property_list.h"
 
 namespace kel::platform {
 

@@ -3,7 +3,7 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/property_list_value.h"
+#include "property_lists/property_list_value.h"
 
 namespace kel::platform {
 

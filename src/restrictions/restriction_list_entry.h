@@ -3,7 +3,7 @@
 #include <cstddef>
 #include <optional>
 
-#include "platform/property_list_value.h"
+#include "property_lists/property_list_value.h"
 
 namespace kel {
 

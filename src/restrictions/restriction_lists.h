@@ -7,8 +7,8 @@
 
 #include "common/common.h"
 #include "platform/file_system.h"
-#include "platform/property_list_value.h"
 #include "platform/standard_directories.h"
+#include "property_lists/property_list_value.h"
 #include "restrictions/restriction_list_entry.h"
 
 namespace kel {

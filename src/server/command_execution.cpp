@@ -1,7 +1,7 @@
 #include <utility>
 
 #include "common/common.h"
-#include "platform/property_list.h"
+#include "property_lists/property_list.h"
 #include "server/server.h"
 
 namespace kel {

@@ -11,10 +11,10 @@
 #include <string>
 #include <vector>
 
-#include "client/request_protocol.h"
 #include "datastore/data_store.h"
 #include "platform/guarded.h"
 #include "platform/platform.h"
+#include "protocol/request_protocol.h"
 
 namespace kel {
 

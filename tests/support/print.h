@@ -2,7 +2,7 @@
 
 #include <ostream>
 
-#include "platform/property_list.h"
+#include "property_lists/property_list.h"
 
 // How test failures show property-list values.
 namespace kel::platform {

@@ -5,7 +5,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/property_list_value.h"
+#include "property_lists/property_list_value.h"
 #include "support/print.h"
 
 namespace kel::test {

@@ -5,7 +5,7 @@
 #include <fcntl.h>
 #include <utility>
 
-#include "platform/linux/files.h"
+#include "platform/linux/files/files.h"
 
 namespace kel::platform {
 

@@ -6,9 +6,9 @@
 #include <gtest/gtest.h>
 #include <set>
 
-#include "platform/linux/files.h"
-#include "platform/linux/linux_file_system.h"
-#include "platform/linux/unix_address.h"
+#include "platform/linux/files/files.h"
+#include "platform/linux/files/linux_file_system.h"
+#include "platform/linux/process/unix_address.h"
 #include "support/in_memory_services.h"
 #include "support/print.h"
 

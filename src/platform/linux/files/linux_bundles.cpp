@@ -1,0 +1,55 @@
+#include "platform/linux/files/linux_bundles.h"
+
+#include <sys/stat.h>
+
+#include "platform/linux/files/files.h"
+
+namespace kel::platform {
+
+namespace {
+
+class LinuxBundle final : public Bundle {
+ public:
+  LinuxBundle(FileSystem& files, SystemLog& log, std::string path)
+      : files_(files), log_(log), path_(std::move(path)) {}
+
+  PropertyListDictionary informationDictionary() override {
+    if (!information_) information_ = readInformation();
+    return *information_;
+  }
+
+  std::optional<PropertyListValue> identifier() override { return bundleIdentifier(informationDictionary()); }
+
+  std::optional<std::string> resourcePath(std::string_view name, std::string_view type,
+                                          std::string_view localization) override {
+    const auto below = localizedResourceName(name, type, localization);
+    if (!below) return std::nullopt;
+    std::string path = joinPath(path_, *below);
+    struct stat status {};
+    if (stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return std::nullopt;
+    return path;
+  }
+
+ private:
+  PropertyListDictionary readInformation() {
+    const std::string path = joinPath(path_, "Info.plist");
+    DictionaryReading reading = readDictionaryFile(files_, path, largestForeignFile, bundleFileLimits);
+    if (reading.dictionary) return std::move(*reading.dictionary);
+    if (files_.exists(path))
+      log_.write("Cannot read the information dictionary " + path + ": " + reading.error);
+    return {};
+  }
+
+  FileSystem& files_;
+  SystemLog& log_;
+  const std::string path_;
+  std::optional<PropertyListDictionary> information_;
+};
+
+}  // namespace
+
+std::unique_ptr<Bundle> LinuxBundles::open(const std::string& path) {
+  return isDirectory(path) ? std::make_unique<LinuxBundle>(files_, log_, path) : nullptr;
+}
+
+}  // namespace kel::platform

@@ -1,0 +1,31 @@
+#include "platform/linux/registry/application_information.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <utility>
+
+#include "platform/application_registry.h"
+#include "platform/file_system.h"
+
+namespace kel::platform {
+
+InformationStatus informationStatus(const std::string& application) {
+  const EntryRecord record = lookAtEntry(AT_FDCWD, informationPath(application).c_str());
+  InformationStatus result{record.isLink() ? record.target : record.status, true, record.isLink()};
+  if (result.exists()) return result;
+  const std::uint64_t error = std::exchange(result.status, {}).size;
+  result.isKnown = error == ENOENT || error == ENOTDIR || error == ELOOP;
+  return result;
+}
+
+std::uint32_t informationFlags(BytesView contents) {
+  const PropertyListReading reading = readPropertyList(contents, bundleFileLimits);
+  const PropertyListDictionary* dictionary = reading.value ? reading.value->asDictionary() : nullptr;
+  const PropertyListValue* services = dictionary ? dictionary->find("QVServices") : nullptr;
+  const PropertyListArray* array = services ? services->asArray() : nullptr;
+  return array && !array->empty() ? ApplicationRegistry::providesServices : 0;
+}
+
+std::string informationPath(const std::string& application) { return joinPath(application, "Info.plist"); }
+
+}  // namespace kel::platform

@@ -1,0 +1,215 @@
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <thread>
+
+#include "platform/linux/files/linux_bundles.h"
+#include "platform/linux/notifications/linux_notification_seeds.h"
+#include "platform/linux/registry/linux_application_registry.h"
+#include "platform/linux/scratch.h"
+
+namespace kel::platform {
+namespace {
+
+using namespace std::string_literals;
+using namespace std::chrono_literals;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::StartsWith;
+
+TEST(ReadSmallFile, TakesWhatTheSystemGivesInOnePieceOnly) {
+  const std::string path = "/proc/sys/fs/inotify/max_user_watches";
+  std::string expected;
+  if (!std::getline(std::ifstream(path), expected)) GTEST_SKIP() << "no such setting";
+  EXPECT_EQ(readSmallFile(AT_FDCWD, path), expected + "\n");
+}
+
+TEST_F(ScratchTest, ReadGivesRegularFilesUpToTheLimit) {
+  const std::string file = scratch.write("file", "12345");
+  EXPECT_EQ(files.read(file, 5).bytes, (Bytes{'1', '2', '3', '4', '5'}));
+  EXPECT_EQ(files.read(file, 4).error, file + ": File too large");
+  EXPECT_TRUE(files.read("/proc/self/status", 1 << 20).bytes) << "a file that states no size";
+  EXPECT_FALSE(files.read(file + "\0x"s, 5).bytes) << "a NUL must not cut the path";
+}
+
+TEST_F(ScratchTest, AtomicWriteReplacesAFileOrALinkAndMakesPrivateParents) {
+  EXPECT_EQ(files.writeAtomically(scratch / "a/b/file", Bytes{'1'}), std::nullopt);
+  EXPECT_EQ(files.writeAtomically(scratch / "a/b/file", Bytes{'2'}), std::nullopt);
+  EXPECT_EQ(scratch.mode("a") | scratch.mode("a/b"), 0700u);
+  EXPECT_EQ(scratch.mode("a/b/file"), 0600u);
+  symlink("a/b/file", (scratch / "link").c_str());
+  EXPECT_EQ(files.writeAtomically(scratch / "link", Bytes{'3'}), std::nullopt);
+  EXPECT_EQ(scratch.read("link") + scratch.read("a/b/file"), "32");
+}
+
+TEST_F(ScratchTest, FailedAtomicWriteLeavesTheOldContentsAndNoTemporaryFile) {
+  scratch.write("file", "old");
+  scratch.makeDirectory("directory/inside");
+  const auto before = scratch.names();
+  signal(SIGXFSZ, SIG_IGN);
+  rlimit unlimited{};
+  getrlimit(RLIMIT_FSIZE, &unlimited);
+  const rlimit full{64 * 1024, unlimited.rlim_max};  // as on a full disk
+  setrlimit(RLIMIT_FSIZE, &full);
+  EXPECT_EQ(files.writeAtomically(scratch / "file", Bytes(256 * 1024)), scratch / "file: File too large");
+  setrlimit(RLIMIT_FSIZE, &unlimited);
+  EXPECT_EQ(files.writeAtomically(scratch / "directory", {}), scratch / "directory: Is a directory");
+  EXPECT_EQ(files.writeAtomically(scratch / "file/below", {}), scratch / "file: Not a directory");
+  for (const std::string& name : {"file/"s, std::string(300, 'n'), "file\0x"s}) {
+    EXPECT_TRUE(files.writeAtomically(scratch / name, {})) << name;
+  }
+  EXPECT_EQ(scratch.read("file"), "old");
+  EXPECT_EQ(scratch.names(), before);
+}
+
+class LinuxApplicationsTest : public ScratchTest {
+ protected:
+  LinuxApplicationsTest() {
+    for (const char* name : {"a/fifo.app", "a/device.app", "a/missing.app"}) scratch.makeDirectory(name);
+    mkfifo((scratch / "a/fifo.app/Info.plist").c_str(), 0600);
+    symlink("/dev/zero", (scratch / "a/device.app/Info.plist").c_str());
+    scratch.write("a/malformed.app/Info.plist", "{ QVServices = (");
+    scratch.write("a/array.app/Info.plist", "(a)");
+    truncate(scratch.write("a/huge.app/Info.plist").c_str(), largestForeignFile + 1);
+  }
+
+  /// The paths of the applications found, below the scratch directory.
+  std::vector<std::string> found(std::uint32_t flags) {
+    LinuxApplicationRegistry registry(files, log, queue, {scratch / "b/", scratch / "a/", scratch / "none/"},
+                                      std::nullopt, nullptr);
+    std::vector<std::string> result;
+    for (const RegisteredApplication& application : registry.applications(flags, flags)) {
+      result.push_back(application.path.value().substr(scratch.path().size() + 1));
+    }
+    return result;
+  }
+
+  LinuxBundles bundles{files, log};
+  ConcurrentQueue queue;
+};
+
+TEST_F(LinuxApplicationsTest, UnusableInformationCountsAsEmptyAndIsLoggedOnceUnlessItIsMissing) {
+  for (const std::string name : {"missing", "fifo", "device", "malformed", "array", "huge"}) {
+    const auto bundle = bundles.open(scratch / "a/" + name + ".app");
+    EXPECT_TRUE(bundle->informationDictionary().empty() && !bundle->identifier()) << name;
+    const std::string line = "Cannot read the information dictionary " + scratch / "a/" + name + ".app/";
+    EXPECT_THAT(log.take(),
+                testing::Conditional(name == "missing", IsEmpty(), ElementsAre(StartsWith(line))));
+  }
+  EXPECT_EQ(found(0).size(), 6u);
+  EXPECT_THAT(found(ApplicationRegistry::providesServices), IsEmpty());
+}
+
+TEST_F(LinuxApplicationsTest, RegistryHoldsTheApplicationsInPlainFoldersByRootAndPath) {
+  std::filesystem::remove_all(scratch / "a");
+  std::string deep = "b";
+  for (int level = 0; level < 40; ++level) deep += "/f";
+  for (const std::string& name : {"a/A.app/Contents/Inner.app"s, "a/.hidden/H.app"s, deep + "/Deep.app"}) {
+    scratch.makeDirectory(name);
+  }
+  for (const char* bundle :
+       {"a/Z.app", "a/Tools/More/T.app", "a/Plug.bundle", "b/Later.app", "x/Linked.app"}) {
+    scratch.write(std::string(bundle) + "/Info.plist", "{ QVServices = ({}); }");
+  }
+  scratch.write("a/A.app/Info.plist", "{ QVServices = (); }");
+  scratch.makeDirectory("a/Plug.bundle/Inner.app");
+  scratch.write("a/File.app");
+  symlink("../x/Linked.app", (scratch / "a/Link.app").c_str());
+  symlink("../x", (scratch / "a/folder").c_str());
+  symlink("nowhere", (scratch / "a/Dangling.app").c_str());
+  EXPECT_THAT(found(0), ElementsAre("b/Later.app", "a/A.app", "a/Link.app", "a/Tools/More/T.app", "a/Z.app"));
+  EXPECT_THAT(found(ApplicationRegistry::providesServices),
+              ElementsAre("b/Later.app", "a/Link.app", "a/Tools/More/T.app", "a/Z.app"));
+  EXPECT_THAT(log.take(), testing::Each(StartsWith("Too many or too deep folders in ")));
+}
+
+class LinuxNotificationSeedsTest : public ScratchTest {
+ protected:
+  bool isCalled() { return called.wait(20s); }
+
+  SerialQueue queue{"observer"};
+  LinuxNotificationSeeds seeds{scratch / "beacond", log};
+  LinuxNotificationSeeds other{scratch / "beacond", log};  // stands for another process
+  Semaphore called;
+};
+
+TEST_F(LinuxNotificationSeedsTest, PostsOfManyThreadsAndInstancesAreAllCounted) {
+  const NotificationStore store{scratch / "beacond"};
+  seeds.post("name");
+  const auto start = store.read("name")->posts;
+  std::vector<std::thread> threads;
+  for (LinuxNotificationSeeds* instance : {&seeds, &other, &seeds, &other}) {
+    threads.emplace_back([instance] {
+      for (int i = 0; i < 250; ++i) instance->post("name");
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(store.read("name")->posts, start + 1000);
+  EXPECT_THAT(scratch.names("beacond"), ElementsAre(".lock", "name"));
+}
+
+TEST_F(LinuxNotificationSeedsTest, RecordThatIsCutOrChangedAnywhereCountsAsNeverSet) {
+  const auto token = seeds.registerName("name");
+  seeds.setState(token, 7);
+  const std::string whole = scratch.read("beacond/name");
+  const auto stateOf = [&](const std::string& contents) {
+    scratch.write("beacond/name", contents);
+    return seeds.state(token);
+  };
+  for (std::size_t length = 0; length < whole.size(); ++length) {
+    EXPECT_EQ(stateOf(whole.substr(0, length)), 0u) << length;
+    std::string changed = whole;
+    changed[length] = static_cast<char>(changed[length] ^ 1);
+    EXPECT_EQ(stateOf(changed), 0u) << length;
+  }
+  EXPECT_EQ(stateOf(whole + "x"), 0u);
+  EXPECT_EQ(stateOf(whole), 7u);
+  EXPECT_EQ(other.state(other.registerName("name")), 7u) << "another instance";
+  EXPECT_THAT(log.messages(), testing::SizeIs(1)) << "reported once";
+}
+
+TEST_F(LinuxNotificationSeedsTest, EveryPostIsSeenAndANewStateAloneIsNoneAlsoAfterDamageAndLoss) {
+  auto observation = seeds.observe("name", queue, [this] { called.signal(); });
+  for (int post = 1; post <= 20; ++post) {
+    (post % 2 ? seeds : other).post("name");
+    ASSERT_TRUE(isCalled()) << post;
+    seeds.setState(seeds.registerName("name"), static_cast<std::uint64_t>(post));
+    seeds.post("another");
+  }
+  scratch.write("beacond/name", "damaged");
+  other.post("name");
+  EXPECT_TRUE(isCalled());
+  std::filesystem::remove_all(scratch / "beacond");
+  // The directory is watched again once the loss was seen.
+  while (!files.exists(scratch / "beacond")) queue.sync([] {});
+  other.post("name");
+  EXPECT_TRUE(isCalled());
+  queue.sync([&] { observation.reset(); });
+  EXPECT_FALSE(called.wait(0s));
+}
+
+TEST_F(LinuxNotificationSeedsTest, ObservationMayEndItselfAndNothingRunsAfterwards) {
+  auto ended = seeds.observe("name", queue, [this] { called.signal(); });
+  std::unique_ptr<NotificationSeeds::Observation> observation;
+  queue.sync([&] {
+    seeds.post("name");  // its event waits behind this task
+    ended.reset();
+    observation = other.observe("name", queue, [&] {
+      observation.reset();
+      called.signal();
+    });
+  });
+  seeds.post("name");
+  EXPECT_TRUE(isCalled());
+  seeds.post("name");
+  queue.sync([] {});
+  EXPECT_FALSE(called.wait(0s));
+}
+
+TEST(NotificationFileName, NamesNeverLeaveTheDirectoryOrMeetEachOther) {
+  EXPECT_EQ(notificationFileName("../a.b-c"), "%2E.%2Fa.b-c");
+  EXPECT_EQ(notificationFileName("%2Elock"), "%252Elock");
+}
+
+}  // namespace
+}  // namespace kel::platform
