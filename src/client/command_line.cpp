@@ -4,6 +4,7 @@
 #include <set>
 
 #include "common/common.h"
+#include "platform/option_parser.h"
 #include "property_lists/unicode.h"
 #include "restrictions/whitelist_generator.h"
 

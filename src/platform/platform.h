@@ -12,6 +12,7 @@
 #include "platform/guarded.h"
 #include "platform/launch_events.h"
 #include "platform/notification_seeds.h"
+#include "platform/preferences.h"
 #include "platform/process.h"
 #include "platform/sandbox_query.h"
 #include "platform/services_publication.h"

@@ -1,9 +1,5 @@
 #pragma once
 
-#include <string>
-#include <utility>
-#include <vector>
-
 #include "platform/work_queue.h"
 
 namespace kel::platform {
@@ -22,38 +18,6 @@ class Process {
 
   /// The main event loop; it never returns (a test's may).
   virtual void runMainLoop() = 0;
-};
-
-/// One row of an option table: a long option without argument and the value it yields.
-struct LongOption {
-  std::string name;
-  int value = 0;
-};
-
-/// What the parser met next.
-struct ParsedOption {
-  enum class Outcome { Option, Bad, End };
-  Outcome outcome = Outcome::End;
-  int value = 0;
-};
-
-/// The platform's long-option parser in its long-options-only mode: one dash or two, unambiguous prefixes
-/// (with one dash at least two letters), arguments permuted. A bad option is reported on the error stream.
-/// One parse at a time in a process.
-class OptionParser {
- public:
-  /// `arguments` begins with the program's name.
-  OptionParser(std::vector<std::string> arguments, std::vector<LongOption> options);
-
-  ParsedOption next();
-
-  /// After `End`: the arguments that are no options, in their order.
-  std::vector<std::string> remaining() const;
-
- private:
-  std::vector<std::string> arguments_;
-  std::vector<LongOption> options_;
-  std::vector<char*> pointers_;
 };
 
 }  // namespace kel::platform

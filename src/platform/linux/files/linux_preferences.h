@@ -4,7 +4,7 @@
 #include <string>
 
 #include "platform/file_system.h"
-#include "platform/services_publication.h"
+#include "platform/preferences.h"
 
 namespace kel::platform {
 

@@ -1,10 +1,10 @@
+#include "platform/option_parser.h"
+
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <getopt.h>
 #include <string_view>
-
-#include "platform/process.h"
 
 namespace kel::platform {
 
@@ -30,33 +30,42 @@ bool isLoneLetter(std::string_view argument, const std::vector<LongOption>& opti
 
 }  // namespace
 
+struct OptionParser::Body {
+  std::vector<std::string> arguments;
+  const std::vector<LongOption> options;
+  std::vector<char*> pointers;  // to the arguments and null, in the order that the library gives them
+};
+
 OptionParser::OptionParser(std::vector<std::string> arguments, std::vector<LongOption> options)
-    : arguments_(std::move(arguments)), options_(std::move(options)) {
-  for (std::string& argument : arguments_) pointers_.push_back(argument.data());
-  pointers_.push_back(nullptr);
+    : body_(new Body{std::move(arguments), std::move(options), {}}) {
+  for (std::string& argument : body_->arguments) body_->pointers.push_back(argument.data());
+  body_->pointers.push_back(nullptr);
   optind = 0;  // makes the library forget an earlier parse
 }
 
+OptionParser::~OptionParser() = default;
+
 ParsedOption OptionParser::next() {
+  auto& [arguments, options, pointers] = *body_;
   std::vector<option> table;
-  for (const LongOption& row : options_) table.push_back({row.name.c_str(), no_argument, nullptr, row.value});
+  for (const LongOption& row : options) table.push_back({row.name.c_str(), no_argument, nullptr, row.value});
   table.push_back({});
   // The library takes a lone letter for an abbreviation: it is left to step over it in silence.
-  const char* argument = nextOptionArgument(pointers_);
-  const bool isRefused = argument && isLoneLetter(argument, options_);
+  const char* argument = nextOptionArgument(pointers);
+  const bool isRefused = argument && isLoneLetter(argument, options);
   opterr = isRefused ? 0 : 1;
-  const int count = static_cast<int>(arguments_.size());
-  const int result = getopt_long_only(count, pointers_.data(), "", table.data(), nullptr);
+  const int count = static_cast<int>(arguments.size());
+  const int result = getopt_long_only(count, pointers.data(), "", table.data(), nullptr);
   if (result == -1) return {ParsedOption::Outcome::End, 0};
-  if (isRefused) std::fprintf(stderr, "%s: unrecognized option '%s'\n", pointers_[0], argument);
+  if (isRefused) std::fprintf(stderr, "%s: unrecognized option '%s'\n", pointers[0], argument);
   if (isRefused || result == '?') return {ParsedOption::Outcome::Bad, 0};
   return {ParsedOption::Outcome::Option, result};
 }
 
 std::vector<std::string> OptionParser::remaining() const {
   std::vector<std::string> result;
-  for (std::size_t i = static_cast<std::size_t>(optind); i + 1 < pointers_.size(); ++i) {
-    result.emplace_back(pointers_[i]);
+  for (std::size_t i = static_cast<std::size_t>(optind); i + 1 < body_->pointers.size(); ++i) {
+    result.emplace_back(body_->pointers[i]);
   }
   return result;
 }

@@ -5,6 +5,7 @@
 #include "platform/linux/process/linux_system_log.h"
 #include "platform/linux/process/linux_transactions.h"
 #include "platform/linux/process/process_confinement.h"
+#include "platform/option_parser.h"
 #include "platform/linux/scratch.h"
 #include "property_lists/unicode.h"
 
