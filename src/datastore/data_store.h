@@ -9,6 +9,7 @@
 #include <string_view>
 #include <vector>
 
+#include "common/queue_depths.h"
 #include "discovery/path_changes_observer.h"
 #include "discovery/services_provider_locator.h"
 #include "entries/app_entry.h"
@@ -103,7 +104,7 @@ class KELDataStore {
   std::shared_ptr<const std::vector<std::string>> pathsFromAR_;
   std::shared_ptr<const AppEntries> pathsToAppEntries_;
   std::optional<std::vector<std::string>> validPathsForSpellCheckers_;
-  platform::SerialQueue writeQueue_{"Datastore Write Queue"};
+  platform::SerialQueue writeQueue_{"Datastore Write Queue", queue_depths::datastoreWrites};
   platform::EventID eventStreamID_ = 0;
   bool cacheIsLoaded_ = false;
 };

@@ -14,5 +14,8 @@
 /// A member that is touched only on the given queue.
 #define KEL_ON(queue) KEL_ATTRIBUTE(guarded_by(queue))
 
+/// A pointer whose target is touched only on the given queue.
+#define KEL_TARGET_ON(queue) KEL_ATTRIBUTE(pt_guarded_by(queue))
+
 /// A function that is called only on the given queue.
 #define KEL_RUNS_ON(...) KEL_ATTRIBUTE(requires_capability(__VA_ARGS__))

@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cstddef>
 #include <functional>
+#include <limits>
 #include <memory>
 #include <string>
 
@@ -10,17 +11,24 @@
 
 namespace kel::platform {
 
+// Work queues are made wherever work is ordered, so they are no virtual services that are handed down: these
+// classes are the seam, and the platform that is linked in defines their bodies. A test may link in others.
+
 using Task = std::function<void()>;
 
-class EventLoop;
-
 /// Runs tasks one at a time, in the order they came, on a thread of its own that bears the queue's label.
+///
+/// Waiting runs one way: a queue waits, in `sync`, only for deeper ones, so that no two can wait for each
+/// other.
 ///
 /// Tasks may be handed over from any thread. Destroying the queue runs what was queued, drops timers that are
 /// not due, and waits for the thread, unless the last task destroys it: then the thread ends after that task.
 class KEL_CAPABILITY("queue") SerialQueue {
  public:
-  explicit SerialQueue(std::string label);
+  /// The depth of a queue that waits for none.
+  static constexpr int deepest = std::numeric_limits<int>::max();
+
+  explicit SerialQueue(std::string label, int depth = deepest);
   ~SerialQueue();
   SerialQueue(const SerialQueue&) = delete;
   SerialQueue& operator=(const SerialQueue&) = delete;
@@ -30,7 +38,8 @@ class KEL_CAPABILITY("queue") SerialQueue {
   /// Queues `task` and returns at once.
   void async(Task task);
 
-  /// Queues `task` and waits until it has run. Never called from the queue itself.
+  /// Queues `task` and waits until it has run. From no queue, or from one that lies less deep; checked in
+  /// debug builds.
   void sync(const Task& task);
 
   /// Queues `task` when `delay` has passed; a delay that is not positive means at once.
@@ -41,11 +50,12 @@ class KEL_CAPABILITY("queue") SerialQueue {
   /// States that the caller runs on this queue; checked in debug builds.
   void assertCurrent() const KEL_ASSERTS_CAPABILITY(this);
 
-  /// The loop of the queue's thread, for the platform's own event sources.
-  EventLoop& loop();
+  /// What the linked-in platform makes a queue of; for its own event sources.
+  struct Body;
+  Body& body() { return *body_; }
 
  private:
-  std::shared_ptr<EventLoop> loop_;
+  const std::unique_ptr<Body> body_;
 };
 
 /// The shared pool: tasks run in parallel and in no order. One per process, as many threads as processors.
@@ -96,12 +106,6 @@ class Semaphore {
   /// Takes one, waiting up to `timeout` of real time; false when none came. Timed waits of the system go
   /// through `Clock::wait`, so that a test can let time pass.
   bool wait(std::chrono::nanoseconds timeout);
-
-  /// As above, but gives up when `expired` is true; it is asked at the start and after every `poke`.
-  bool waitUnless(const std::function<bool()>& expired);
-
-  /// Makes waiters ask again.
-  void poke();
 
  private:
   struct State;

@@ -42,7 +42,10 @@ void KELServer::incrementServicesSeed() {
 void KELServer::sync(bool sync, std::function<void(KELDataStore&)> tellDataStore) {
   auto work = [this, tellDataStore = std::move(tellDataStore), sink = current_debug_sink(),
                transaction = platform::Transaction(platform_.transactions)] {
-    run_with_debug_sink(sink, [&] { tellDataStore(*protectedDatastore_); });
+    run_with_debug_sink(sink, [&] {
+      datastoreQueue_.assertCurrent();
+      tellDataStore(*protectedDatastore_);
+    });
   };
   if (sync) {
     datastoreQueue_.sync(work);

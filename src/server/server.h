@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "common/queue_depths.h"
 #include "datastore/data_store.h"
 #include "platform/guarded.h"
 #include "platform/platform.h"
@@ -95,7 +96,7 @@ class KELServer {
   const std::string seedName_;
   platform::NotificationSeeds::Token notificationToken_ = 0;
 
-  const std::unique_ptr<KELDataStore> protectedDatastore_;  // its contents only on datastoreQueue_
+  const std::unique_ptr<KELDataStore> protectedDatastore_ KEL_TARGET_ON(datastoreQueue_);
   std::atomic<std::uint32_t> currentGenCount_ = 0;          // raised only on datastoreQueue_
   std::atomic<std::uint64_t> notificationSeed_ = 0;
   std::mutex changingList_;  // held while the list is compared, set and handed to publication
@@ -108,8 +109,8 @@ class KELServer {
   KELStaleCacheFlags staleCacheFlags_ KEL_ON(conduitQueue_) = 0;
 
   // Last, so that work still queued at destruction finds everything above: the conduit queue ends first.
-  platform::SerialQueue datastoreQueue_{"KEL Datastore"};
-  platform::SerialQueue conduitQueue_{"KEL Conduit Server"};
+  platform::SerialQueue datastoreQueue_{"KEL Datastore", queue_depths::datastore};
+  platform::SerialQueue conduitQueue_{"KEL Conduit Server", queue_depths::conduit};
 };
 
 }  // namespace kel

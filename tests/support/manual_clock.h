@@ -16,6 +16,10 @@ namespace kel::test {
 class ManualClock : public platform::Clock {
   using Duration = std::chrono::nanoseconds;
   using Timer = std::pair<platform::SerialQueue*, platform::Task>;
+  struct Wait {
+    platform::Semaphore* semaphore;
+    bool isOver = false;  // its time has passed, for which the semaphore was signalled
+  };
 
  public:
   /// Lets `duration` pass: timers that fall due are queued on their queues in the order of their deadlines,
@@ -31,7 +35,9 @@ class ManualClock : public platform::Clock {
       for (auto timer = timers_.begin(); timer != end; ++timer) due.push_back(std::move(timer->second));
       timers_.erase(timers_.begin(), end);
       // Under the lock, without which no waiter can leave and destroy its semaphore.
-      for (auto wait = waits_.begin(); wait != waits_.upper_bound(now_); ++wait) wait->second->poke();
+      for (auto wait = waits_.begin(); wait != waits_.upper_bound(now_); ++wait) {
+        if (!std::exchange(wait->second.isOver, true)) wait->second.semaphore->signal();
+      }
     }
     for (auto& [queue, task] : due) queue->async(std::move(task));
   }
@@ -50,17 +56,15 @@ class ManualClock : public platform::Clock {
   }
   bool wait(platform::Semaphore& semaphore, Duration timeout) override {
     std::unique_lock lock(mutex_);
-    const Duration deadline = deadlineAfter(timeout);
-    const auto registered = waits_.emplace(deadline, &semaphore);
+    const auto registered = waits_.emplace(deadlineAfter(timeout), Wait{&semaphore});
+    const bool isOver = timeout <= Duration::zero();
     changed_.notify_all();
     lock.unlock();
-    const bool taken = semaphore.waitUnless([&] {
-      const std::lock_guard expiry(mutex_);
-      return now_ >= deadline;
-    });
+    const bool taken = semaphore.wait(isOver ? Duration::zero() : Duration::max());
     lock.lock();
-    waits_.erase(registered);
-    return taken;
+    const Wait wait = waits_.extract(registered).mapped();
+    // The signal of the end counts for nothing: what else was signalled is what was waited for.
+    return wait.isOver ? semaphore.wait(Duration::zero()) : taken;
   }
 
   std::atomic<double> wallClock = 0;
@@ -77,8 +81,8 @@ class ManualClock : public platform::Clock {
   std::mutex mutex_;
   std::condition_variable changed_;
   Duration now_{0};
-  std::multimap<Duration, Timer> timers_;                // by deadline
-  std::multimap<Duration, platform::Semaphore*> waits_;  // by deadline
+  std::multimap<Duration, Timer> timers_;  // by deadline
+  std::multimap<Duration, Wait> waits_;    // by deadline
 };
 
 }  // namespace kel::test

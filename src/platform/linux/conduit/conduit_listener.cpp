@@ -11,6 +11,7 @@
 
 #include "platform/linux/files/files.h"
 #include "platform/linux/process/linux_process.h"
+#include "platform/linux/queues/serial_queue.h"
 
 namespace kel::platform {
 
@@ -35,7 +36,7 @@ OwnedDescriptor spareDescriptor() { return OwnedDescriptor(::open("/dev/null", O
 ConduitAcceptor::ConduitAcceptor(const ConduitServerContext& context, EndpointSocket endpoint,
                                  ConduitEventHandler handler)
     : context_(context),
-      keptLoop_(context.queue.loop().shared_from_this()),
+      keptLoop_(eventLoop(context.queue).shared_from_this()),
       loop_(*keptLoop_),
       handler_(std::move(handler)),
       mostConnections_(connectionLimit()),

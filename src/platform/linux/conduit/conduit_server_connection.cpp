@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "platform/linux/conduit/conduit_server_message.h"
+#include "platform/linux/queues/serial_queue.h"
 #include "property_lists/property_list.h"
 
 namespace kel::platform {
@@ -28,7 +29,7 @@ ConduitServerConnection::ConduitServerConnection(const ConduitServerContext& con
                                                  std::shared_ptr<const LinuxPeerProcess> peer,
                                                  std::function<void(ConduitServerConnection&)> gone)
     : context_(context),
-      keptLoop_(context.queue.loop().shared_from_this()),
+      keptLoop_(eventLoop(context.queue).shared_from_this()),
       loop_(*keptLoop_),
       peer_(std::move(peer)),
       gone_(std::move(gone)),

@@ -4,6 +4,8 @@
 #include <poll.h>
 #include <sys/epoll.h>
 
+#include "platform/linux/queues/serial_queue.h"
+
 namespace kel::platform {
 
 namespace {
@@ -108,7 +110,7 @@ void JournalService::subscribe(std::shared_ptr<JournalSubscription> subscription
 
 void JournalService::open() {
   keeper_.open();
-  EventLoop& loop = queue_.loop();
+  EventLoop& loop = eventLoop(queue_);
   loop.assertCurrent();
   if (const int events = keeper_.forest().eventDescriptor(); events >= 0) {
     eventWatch_ = loop.watch(events, EPOLLIN, [this](std::uint32_t) { readEvents(); });
@@ -149,12 +151,12 @@ void JournalService::scheduleLook() {
 }
 
 void JournalService::readEvents() {
-  queue_.loop().assertCurrent();
+  eventLoop(queue_).assertCurrent();
   keeper_.forest().readEvents();
   finishRound();
   eventWatch_->setEvents(0);
   queue_.after(betweenGulps, [this] {
-    queue_.loop().assertCurrent();
+    eventLoop(queue_).assertCurrent();
     if (eventWatch_) eventWatch_->setEvents(EPOLLIN);
   });
 }

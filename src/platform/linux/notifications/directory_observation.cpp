@@ -8,7 +8,7 @@
 #include <unistd.h>
 
 #include "platform/linux/files/files.h"
-#include "platform/linux/queues/event_loop.h"
+#include "platform/linux/queues/serial_queue.h"
 
 namespace kel::platform {
 
@@ -34,7 +34,7 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
   }
 
   void stop() {
-    queue_.loop().assertCurrent();
+    eventLoop(queue_).assertCurrent();
     stopped_ = true;
     watch_.reset();
   }
@@ -49,7 +49,7 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
 
   void listen() {
     if (stopped_) return;
-    watch_ = queue_.loop().watch(inotify_.get(), EPOLLIN, [self = weak_from_this()](std::uint32_t) {
+    watch_ = eventLoop(queue_).watch(inotify_.get(), EPOLLIN, [self = weak_from_this()](std::uint32_t) {
       if (const auto watcher = self.lock()) watcher->look();
     });
     if (!watch_) log_.write("Cannot watch notifications: " + errorLine(store_.directory(), errno));

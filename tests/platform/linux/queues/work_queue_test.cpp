@@ -8,7 +8,7 @@
 #include <sys/eventfd.h>
 #include <thread>
 
-#include "platform/linux/queues/event_loop.h"
+#include "platform/linux/queues/serial_queue.h"
 
 namespace kel::platform {
 namespace {
@@ -64,6 +64,19 @@ TEST(SerialQueueTest, ATaskMayDestroyItsQueueAndTheThreadGoesOnToRunTheRest) {
   EXPECT_EQ(queue, nullptr);
 }
 
+TEST(SerialQueueTest, AQueueWaitsForDeeperOnesOnly) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  const auto nested = [](int outer, int inner) {
+    SerialQueue waiting("waiting", outer), waitedFor("waited for", inner);
+    bool ran = false;
+    waiting.sync([&] { waitedFor.sync([&] { ran = true; }); });
+    return ran;
+  };
+  EXPECT_TRUE(nested(1, 2) && nested(0, SerialQueue::deepest));
+  EXPECT_DEBUG_DEATH(nested(2, 1), "currentDepth");
+  EXPECT_DEBUG_DEATH(nested(SerialQueue::deepest, SerialQueue::deepest), "currentDepth");
+}
+
 TEST(EventLoopTest, ADescriptorRemovedByAnotherOnesCallbackIsNotServedEvenWhenItsEventWasFetched) {
   SerialQueue queue("watch");
   const OwnedDescriptor first(eventfd(1, EFD_CLOEXEC)), second(eventfd(1, EFD_CLOEXEC));
@@ -74,8 +87,8 @@ TEST(EventLoopTest, ADescriptorRemovedByAnotherOnesCallbackIsNotServedEvenWhenIt
     watches = {};
   };
   queue.sync([&] {
-    watches[0] = queue.loop().watch(first.get(), EPOLLIN, serve);
-    watches[1] = queue.loop().watch(second.get(), EPOLLIN, serve);
+    watches[0] = eventLoop(queue).watch(first.get(), EPOLLIN, serve);
+    watches[1] = eventLoop(queue).watch(second.get(), EPOLLIN, serve);
   });
   for (int i = 0; i < 3; ++i) queue.sync([] {});
   queue.sync([&] { EXPECT_EQ(served, 1); });
