@@ -103,6 +103,7 @@ class Journal {
   Journal(const std::string& corpus, bool live)
       : corpus_(corpus), state_(corpus + (live ? ".live-journal" : ".journal")) {
     options_.directory = state_;
+    options_.applicationDirectories = {corpus_ + "/Applications/"};
     options_.limits.live = live;
     fs::remove_all(state_);
     start();
@@ -114,7 +115,7 @@ class Journal {
   /// From nothing to the answer that nothing changed, or to the last watch.
   void start() {
     journal_ = std::make_unique<LinuxEventJournal>(options_, files_, log_, pool_);
-    journal_->setRoots({{corpus_ + "/Library/Services/", false}, {corpus_ + "/Applications/", true}});
+    journal_->watch({corpus_ + "/Library/Services/"});
     journal_->currentEventID();
   }
   void stop() { journal_.reset(); }

@@ -10,9 +10,6 @@
 int main(int argc, char** argv) {
   kel::platform::LinuxPlatform linuxPlatform;
   kel::platform::Platform& platform = linuxPlatform.platform();
-  if (kel::running_from_launcher(platform.facts)) {
-    linuxPlatform.watchServiceDirectories(kel::explicit_service_directories(platform.directories));
-    return kel::run_as_server(platform);
-  }
+  if (kel::running_from_launcher(platform.facts)) return kel::run_as_server(platform);
   return kel::parse_arguments(std::vector<std::string>(argv, argv + argc), platform, std::cout);
 }

@@ -60,6 +60,11 @@ class EventJournal {
  public:
   virtual ~EventJournal() = default;
 
+  /// Names the directories, paths with a trailing "/", whose changes the journal is to know, beside those of
+  /// the applications. Once, before anything else is asked; without it the journal knows of no change.
+  virtual void watch(const std::vector<std::string>& serviceDirectories) = 0;
+
+  /// The newest position; 0 when none can be given.
   virtual EventID currentEventID() = 0;
 
   /// A stream over `paths` from `since`, which calls `callback` (kept until the stream is destroyed) and

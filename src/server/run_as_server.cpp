@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "common/common.h"
 #include "property_lists/property_list.h"
 
 namespace kel {
@@ -59,6 +60,7 @@ void subscribeToLaunchEvents(platform::Platform& platform, KELServer& server) {
 
 int run_as_server(platform::Platform& platform) {
   platform.conduit.trackActivity();
+  platform.journal.watch(explicit_service_directories(platform.directories));
   KELServer server(platform);
   // Before the endpoint is there: whoever can reach the server can also end it with success.
   platform.process.onTermination([&platform] { platform.process.exitNow(0); });

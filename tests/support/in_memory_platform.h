@@ -31,9 +31,24 @@ struct InMemoryPlatform {
   InMemoryProcess process;
   platform::ProcessConstants constants;
 
-  platform::Platform platform{clock,       concurrentQueue, files,    directories, bundles,      facts,
-                              log,         transactions,    conduit,  sandbox,     launchEvents, seeds,
-                              publication, publication,     registry, journal,     process,      constants};
+  platform::Platform platform{.clock = clock,
+                              .concurrentQueue = concurrentQueue,
+                              .files = files,
+                              .directories = directories,
+                              .bundles = bundles,
+                              .facts = facts,
+                              .log = log,
+                              .transactions = transactions,
+                              .conduit = conduit,
+                              .sandbox = sandbox,
+                              .launchEvents = launchEvents,
+                              .seeds = seeds,
+                              .publication = publication,
+                              .preferences = publication,
+                              .applications = registry,
+                              .journal = journal,
+                              .process = process,
+                              .constants = constants};
 };
 
 }  // namespace kel::test

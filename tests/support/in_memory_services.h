@@ -137,6 +137,7 @@ class InMemoryRegistry : public platform::ApplicationRegistry {
 /// A journal in memory: replays what was recorded, and misbehaves on demand. One test thread arranges it.
 class InMemoryJournal : public platform::EventJournal {
  public:
+  void watch(const std::vector<std::string>& directories) override { watchedDirectories = directories; }
   platform::EventID currentEventID() override { return newest_; }
   std::unique_ptr<platform::JournalStream> createStream(platform::JournalCallback callback,
                                                         const std::vector<std::string>& paths,
@@ -164,6 +165,7 @@ class InMemoryJournal : public platform::EventJournal {
     platform::EventID since = 0;
     std::uint32_t flags = 0;
   };
+  std::vector<std::string> watchedDirectories;       ///< what `watch` was told
   std::vector<Creation> creations;                   ///< every stream asked for
   std::vector<platform::JournalEvent> afterHistory;  ///< one more batch, delivered after history done
   bool refuseWatchRoot = false;                      ///< no stream that watches its roots can be made
@@ -184,7 +186,7 @@ class InMemoryJournal : public platform::EventJournal {
 
     void setQueue(platform::SerialQueue& queue) override { queue_ = &queue; }
     bool start() override {
-      if (journal_.refuseStart) return false;
+      if (journal_.refuseStart || !queue_) return false;
       queue_->async([callback = callback_, batch = batch_] { callback(batch); });
       if (!journal_.afterHistory.empty()) {
         queue_->async([callback = callback_, later = journal_.afterHistory] { callback(later); });

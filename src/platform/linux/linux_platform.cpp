@@ -16,8 +16,10 @@ std::string recordDirectory(const RuntimeDirectory& runtime) {
   return runtime.path ? joinPath(*runtime.path, "beacond") : "/dev/null/beacond";
 }
 
-JournalOptions journalOptions(const std::optional<std::string>& stateDirectory) {
+JournalOptions journalOptions(const std::optional<std::string>& stateDirectory,
+                              std::vector<std::string> applicationDirectories) {
   JournalOptions options;
+  options.applicationDirectories = std::move(applicationDirectories);
   // Half of what the user may watch is left to the user's other programs.
   const auto most = readSmallFile(AT_FDCWD, "/proc/sys/fs/inotify/max_user_watches");
   std::size_t mostOfUser = 0;
@@ -42,25 +44,32 @@ LinuxPlatform::LinuxPlatform()
       seeds_(recordDirectory(runtimeDirectory_), log_),
       publication_(files_, log_, directories_.stateDirectory()),
       preferences_(files_, directories_.stateDirectory(), directories_.configurationDirectory()),
-      journal_(journalOptions(directories_.stateDirectory()), files_, log_, concurrentQueue_),
+      journal_(journalOptions(directories_.stateDirectory(),
+                              LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory())),
+               files_, log_, concurrentQueue_),
       applications_(files_, log_, concurrentQueue_,
                     LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory()),
                     directories_.stateDirectory(), &journal_),
       launchEvents_(seeds_, log_, journal_, applications_),
-      platform_{clock_,       concurrentQueue_, files_,        directories_, bundles_,      facts_,
-                log_,         transactions_,    conduit_,      sandbox_,     launchEvents_, seeds_,
-                publication_, preferences_,     applications_, journal_,     process_,      constants_} {
+      platform_{.clock = clock_,
+                .concurrentQueue = concurrentQueue_,
+                .files = files_,
+                .directories = directories_,
+                .bundles = bundles_,
+                .facts = facts_,
+                .log = log_,
+                .transactions = transactions_,
+                .conduit = conduit_,
+                .sandbox = sandbox_,
+                .launchEvents = launchEvents_,
+                .seeds = seeds_,
+                .publication = publication_,
+                .preferences = preferences_,
+                .applications = applications_,
+                .journal = journal_,
+                .process = process_,
+                .constants = constants_} {
   if (!runtimeDirectory_.path) log_.write("No runtime directory: " + runtimeDirectory_.error);
-}
-
-void LinuxPlatform::watchServiceDirectories(const std::vector<std::string>& directories) {
-  std::vector<WatchedRoot> roots;
-  for (const std::string& directory : directories) roots.push_back({directory, false});
-  for (std::string& directory :
-       LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory())) {
-    roots.push_back({std::move(directory), true});
-  }
-  journal_.setRoots(std::move(roots));
 }
 
 }  // namespace kel::platform

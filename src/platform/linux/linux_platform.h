@@ -1,9 +1,5 @@
 #pragma once
 
-#include <optional>
-#include <string>
-#include <vector>
-
 #include "platform/linux/conduit/linux_conduit.h"
 #include "platform/linux/files/linux_bundles.h"
 #include "platform/linux/files/linux_file_system.h"
@@ -37,10 +33,6 @@ class LinuxPlatform {
   LinuxPlatform& operator=(const LinuxPlatform&) = delete;
 
   Platform& platform() { return platform_; }
-
-  /// The directories, paths with a trailing "/", in which the journal watches for services, beside those of
-  /// the applications. Before the journal is used; nothing is watched before.
-  void watchServiceDirectories(const std::vector<std::string>& directories);
 
  private:
   // In the order of need: each borrows only what stands before it.

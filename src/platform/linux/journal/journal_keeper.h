@@ -15,7 +15,8 @@ namespace kel::platform {
 
 /// What the journal is made with.
 struct JournalOptions {
-  std::optional<std::string> directory;  ///< for the index; absent: nothing outlasts the process
+  std::vector<std::string> applicationDirectories;  ///< watched beside those of the services
+  std::optional<std::string> directory;             ///< for the index; absent: nothing outlasts the process
   JournalForest::Limits limits;
   std::chrono::milliseconds longestLook{5'000};      ///< per question; after that it cannot be told
   std::function<std::int64_t()> now = timeStampNow;  ///< what positions follow, nanoseconds

@@ -36,13 +36,14 @@ LinuxEventJournal::LinuxEventJournal(JournalOptions options, FileSystem& files, 
 
 LinuxEventJournal::~LinuxEventJournal() = default;
 
-void LinuxEventJournal::setRoots(std::vector<WatchedRoot> roots) {
-  roots_.clear();
-  for (WatchedRoot& root : roots) {
+void LinuxEventJournal::watch(const std::vector<std::string>& serviceDirectories) {
+  const auto add = [this](const std::string& path, bool holdsApplications) {
     const bool isNew = std::none_of(roots_.begin(), roots_.end(),
-                                    [&root](const WatchedRoot& other) { return other.path == root.path; });
-    if (isNew) roots_.push_back(std::move(root));
-  }
+                                    [&path](const WatchedRoot& root) { return root.path == path; });
+    if (isNew) roots_.push_back({path, holdsApplications});
+  };
+  for (const std::string& directory : serviceDirectories) add(directory, false);
+  for (const std::string& directory : options_.applicationDirectories) add(directory, true);
 }
 
 bool LinuxEventJournal::start(ChangeHandler changed) {

@@ -33,8 +33,8 @@ class LinuxEventJournal final : public EventJournal, public ChangeLog {
   /// Writes the index file when it lags behind. No stream and no other call may be left.
   ~LinuxEventJournal() override;
 
-  /// What to watch; a path that comes again is left out. Before everything else.
-  void setRoots(std::vector<WatchedRoot> roots);
+  /// A path that comes again is left out.
+  void watch(const std::vector<std::string>& serviceDirectories) override;
 
   /// Begins to watch, in the background; `changed` is called for what happens from then on. Without this call
   /// the first question begins it. A further call without a handler ends that: none is called once

@@ -232,7 +232,7 @@ class Server {
 
   void start() {
     journal_.emplace(options_, files_, log, pool_);
-    journal_->setRoots({{root_, false}});
+    journal_->watch({root_});
     journal_->start([](JournalForest::Hints) {});
   }
   void stop() { journal_.reset(); }

@@ -27,7 +27,7 @@ class EventJournalTest : public ScratchTest, public testing::WithParamInterface<
   LinuxEventJournal& journal() {
     if (!journal_) {
       journal_.emplace(options, files, log, pool_);
-      journal_->setRoots({{root, false}});
+      journal_->watch({root});
       if (changed) journal_->start(changed);
     }
     return *journal_;

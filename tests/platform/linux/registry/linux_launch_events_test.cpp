@@ -21,8 +21,8 @@ TEST_F(ScratchTest, EveryLaunchEventStreamFiresAtTheStartAndForItsOwnChanges) {
   const std::string applications = scratch.makeDirectory("Applications") + "/";
   ConcurrentQueue pool;
   LinuxNotificationSeeds seeds(scratch / "run", log);
-  LinuxEventJournal journal({}, files, log, pool);
-  journal.setRoots({{services, false}, {applications, true}});
+  LinuxEventJournal journal({.applicationDirectories = {applications}}, files, log, pool);
+  journal.watch({services});
   LinuxApplicationRegistry registry(files, log, pool, {applications}, scratch / "state", &journal);
   SerialQueue queue("handlers");
   Stream beacond("beacond"), broadcastd("broadcastd"), vigil("vigil");
