@@ -1,3 +1,5 @@
+#include "platform/linux/conduit/launcher_sockets.h"
+
 #include <charconv>
 #include <cstdlib>
 #include <fcntl.h>
@@ -5,8 +7,6 @@
 #include <unistd.h>
 #include <utility>
 #include <vector>
-
-#include "platform/linux/conduit/endpoint_socket.h"
 
 namespace kel::platform {
 

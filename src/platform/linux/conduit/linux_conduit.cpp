@@ -4,6 +4,7 @@
 
 #include "platform/linux/conduit/conduit_client_connection.h"
 #include "platform/linux/conduit/conduit_listener.h"
+#include "platform/linux/conduit/endpoint_socket.h"
 
 namespace kel::platform {
 
