@@ -6,6 +6,7 @@
 
 #include "platform/application_registry.h"
 #include "platform/file_system.h"
+#include "platform/linux/journal/entry_look.h"
 
 namespace kel::platform {
 

@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "platform/linux/files/files.h"
+#include "platform/linux/journal/entry_look.h"
 #include "platform/linux/registry/application_information.h"
 
 namespace kel::platform {
