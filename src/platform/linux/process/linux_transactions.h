@@ -1,14 +1,13 @@
 #pragma once
 
-#include <condition_variable>
 #include <cstdint>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
 
 #include "platform/linux/files/owned_descriptor.h"
 #include "platform/linux/process/unix_address.h"
+#include "platform/linux/queues/monitor.h"
 #include "platform/transactions.h"
 
 namespace kel::platform {
@@ -35,18 +34,22 @@ class LinuxTransactions final : public Transactions {
  private:
   enum class Report { Taken, KeptBack, Unheard };
 
+  struct Work {
+    std::uint64_t open = 0;
+    bool ending = false;  // nobody is to be told any more
+  };
+  using Wake = Monitor<Work>::Wake;
+
   void reportChanges();
+  std::optional<std::uint64_t> awaitNews(std::optional<std::uint64_t> told);
   Report report(bool withReadiness, std::uint64_t count) const;
 
   // Fixed after construction.
   std::optional<UnixAddress> address_;
   OwnedDescriptor socket_;
 
-  std::mutex mutex_;
-  std::condition_variable changed_;
-  std::uint64_t count_ = 0;  // under mutex_
-  bool ending_ = false;      // under mutex_
-  std::thread reporter_;
+  Monitor<Work> work_;    // only the reporter waits for its changes
+  std::thread reporter_;  // none before `trackActivity`
 };
 
 }  // namespace kel::platform
