@@ -11,6 +11,7 @@
 
 #include "platform/linux/files/files.h"
 #include "platform/linux/process/linux_process.h"
+#include "platform/linux/queues/while_alive.h"
 
 namespace kel::platform {
 
@@ -45,12 +46,8 @@ ConduitAcceptor::ConduitAcceptor(const ConduitServerContext& context, EndpointSo
 void ConduitAcceptor::open() {
   loop_.assertCurrent();
   if (!endpoint_) return;
-  watch_ = loop_.watch(endpoint_->get(), EPOLLIN, [weak = weak_from_this()](std::uint32_t) {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    self->acceptSome();
-  });
+  watch_ = loop_.watch(endpoint_->get(), EPOLLIN,
+                       whileAlive(weak_from_this(), loop_, &ConduitAcceptor::acceptSome));
   if (!watch_) report(errno);
 }
 
@@ -123,16 +120,14 @@ void ConduitAcceptor::admit(OwnedDescriptor socket) {
   const std::uint64_t age = ++lastConnection_;
   auto peer = LinuxPeerProcess::ofSocket(socket.get(), credentials.pid);
   const auto connection = std::make_shared<ConduitServerConnection>(
-      context_, std::move(socket), std::move(peer), [weak = weak_from_this(), age](ConduitServerConnection&) {
-        const auto self = weak.lock();
-        if (!self) return;
-        self->loop_.assertCurrent();
-        self->connections_.erase(age);
-      });
+      context_, std::move(socket), std::move(peer),
+      whileAlive(weak_from_this(), loop_, &ConduitAcceptor::forget, age));
   if (!connection->open()) return;
   connections_.emplace(age, connection);
   handler_(std::shared_ptr<ConduitConnection>(connection));
 }
+
+void ConduitAcceptor::forget(std::uint64_t age) { connections_.erase(age); }
 
 bool ConduitAcceptor::makeRoom() {
   if (connections_.size() < mostConnections_) return true;
@@ -147,12 +142,12 @@ void ConduitAcceptor::rest() {
   if (!watch_) return;
   // The socket stays ready, so that watching on would keep the loop busy.
   watch_->setEvents(0);
-  context_.clock.after(context_.queue, restInterval, [weak = weak_from_this()] {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    if (self->watch_) self->watch_->setEvents(EPOLLIN);
-  });
+  context_.clock.after(context_.queue, restInterval,
+                       whileAlive(weak_from_this(), loop_, &ConduitAcceptor::resume));
+}
+
+void ConduitAcceptor::resume() {
+  if (watch_) watch_->setEvents(EPOLLIN);
 }
 
 void ConduitAcceptor::report(int error) {
@@ -162,9 +157,7 @@ void ConduitAcceptor::report(int error) {
 LinuxConduitListener::LinuxConduitListener(const ConduitServerContext& context, EndpointSocket endpoint,
                                            ConduitEventHandler handler)
     : acceptor_(std::make_shared<ConduitAcceptor>(context, std::move(endpoint), std::move(handler))) {
-  context.queue.async([weak = std::weak_ptr(acceptor_)] {
-    if (const auto acceptor = weak.lock()) acceptor->open();
-  });
+  context.queue.async(whileAlive(std::weak_ptr(acceptor_), context.queue.loop(), &ConduitAcceptor::open));
 }
 
 }  // namespace kel::platform

@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "platform/linux/conduit/conduit_server_message.h"
+#include "platform/linux/queues/while_alive.h"
 #include "property_lists/property_list.h"
 
 namespace kel::platform {
@@ -26,7 +27,7 @@ constexpr int sendsInARow = 8;           // then the other connections have thei
 
 ConduitServerConnection::ConduitServerConnection(const ConduitServerContext& context, OwnedDescriptor socket,
                                                  std::shared_ptr<const LinuxPeerProcess> peer,
-                                                 std::function<void(ConduitServerConnection&)> gone)
+                                                 std::function<void()> gone)
     : context_(context),
       keptLoop_(context.queue.loop().shared_from_this()),
       loop_(*keptLoop_),
@@ -36,12 +37,8 @@ ConduitServerConnection::ConduitServerConnection(const ConduitServerContext& con
 
 bool ConduitServerConnection::open() {
   loop_.assertCurrent();
-  watch_ = loop_.watch(socket_.get(), interest_, [weak = weak_from_this()](std::uint32_t events) {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    self->serve(events);
-  });
+  watch_ = loop_.watch(socket_.get(), interest_,
+                       whileAlive(weak_from_this(), loop_, &ConduitServerConnection::serve));
   return watch_ != nullptr;
 }
 
@@ -146,8 +143,8 @@ void ConduitServerConnection::take(const Frame& frame) {
   PropertyListReading reading = readBinaryPropertyList(frame.payload, limits);
   if (!reading.value) return refuse("malformed message: " + reading.error);
   ++inFlight_;
-  const ConduitEvent event = std::shared_ptr<ConduitMessage>(
-      std::make_shared<ConduitServerMessage>(weak_from_this(), frame.tag, std::move(*reading.value)));
+  const ConduitEvent event = std::shared_ptr<ConduitMessage>(std::make_shared<ConduitServerMessage>(
+      weak_from_this(), keptLoop_, frame.tag, std::move(*reading.value)));
   const std::shared_ptr<const ConduitEventHandler> handler = handler_;
   if (handler && *handler) (*handler)(event);
 }
@@ -196,12 +193,8 @@ void ConduitServerConnection::watchProgress() {
   timerRuns_ = true;
   receivedBefore_ = received_;
   sentBefore_ = sent_;
-  context_.clock.after(context_.queue, progressInterval, [weak = weak_from_this()] {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    self->checkProgress();
-  });
+  context_.clock.after(context_.queue, progressInterval,
+                       whileAlive(weak_from_this(), loop_, &ConduitServerConnection::checkProgress));
 }
 
 void ConduitServerConnection::checkProgress() {
@@ -238,7 +231,7 @@ void ConduitServerConnection::finish() {
   const auto handler = handler_;
   shut();
   handler_ = handler;
-  gone_(*this);
+  gone_();
   if (started_) deliverInvalid();
 }
 
