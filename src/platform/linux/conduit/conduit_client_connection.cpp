@@ -21,19 +21,19 @@ ConduitError errorObject(ConduitError::Kind kind) {
 }  // namespace
 
 void ConduitClientConnection::setEventHandler(ConduitEventHandler handler) {
-  const std::lock_guard lock(exchanging_);
+  const MutexLock lock(exchanging_);
   handler_ = std::make_shared<const ConduitEventHandler>(std::move(handler));
 }
 
 void ConduitClientConnection::start() {
-  const std::lock_guard lock(exchanging_);
+  const MutexLock lock(exchanging_);
   if (!path_.empty()) socket_ = connectToEndpoint(path_, 0);
   if (!socket_) fail(ConduitError::Kind::ConnectionInvalid);
 }
 
 ConduitReply ConduitClientConnection::sendAndWait(const PropertyListValue& contents) {
   assert(!queue_.isCurrent());
-  const std::lock_guard lock(exchanging_);
+  const MutexLock lock(exchanging_);
   return exchange(contents);
 }
 

@@ -40,40 +40,47 @@ class JournalService {
   void subscribe(std::shared_ptr<JournalSubscription> subscription);
 
  private:
-  void open();
-  void look();
-  void lookFurther();
-  void readEvents();
-  void noteMounts();
-  void doubtMounts();
-  void scheduleLook();
-  void finishRound();
-  void deliverLive();
-  void scheduleSaving();
-  void save();
+  /// A subscription and the position up to which its events were delivered.
+  struct Reader {
+    std::weak_ptr<JournalSubscription> subscription;
+    EventID position = 0;
+  };
+
+  void open() KEL_RUNS_ON(queue_);
+  void look() KEL_RUNS_ON(queue_);
+  void lookFurther() KEL_RUNS_ON(queue_);
+  void readEvents() KEL_RUNS_ON(queue_);
+  void noteMounts() KEL_RUNS_ON(queue_);
+  void doubtMounts() KEL_RUNS_ON(queue_);
+  void scheduleLook() KEL_RUNS_ON(queue_);
+  void lookAfter(std::chrono::nanoseconds pause) KEL_RUNS_ON(queue_);
+  void finishRound() KEL_RUNS_ON(queue_);
+  void deliverLive() KEL_RUNS_ON(queue_);
+  void dropClosedReaders() KEL_RUNS_ON(queue_);
+  void scheduleSaving() KEL_RUNS_ON(queue_);
+  void save() KEL_RUNS_ON(queue_);
 
   const JournalOptions options_;
   FileSystem& files_;
   SystemLog& log_;
   ConcurrentQueue& pool_;
 
-  // Only on the queue.
-  JournalKeeper keeper_;
-  MountTable mounts_;
-  ChangeHandler changed_;
-  std::vector<std::weak_ptr<JournalSubscription>> subscriptions_;
-  std::unique_ptr<EventLoop::Watch> eventWatch_;
-  std::unique_ptr<EventLoop::Watch> mountWatch_;
-  std::chrono::steady_clock::time_point lookStart_;
-  std::chrono::steady_clock::time_point lastSaving_;
-  std::chrono::steady_clock::duration lastLook_{};
-  bool isLooking_ = false;  // or about to
-  bool isSavingScheduled_ = false;
+  JournalKeeper keeper_ KEL_ON(queue_);
+  MountTable mounts_ KEL_ON(queue_);
+  ChangeHandler changed_ KEL_ON(queue_);
+  std::vector<Reader> readers_ KEL_ON(queue_);
+  std::unique_ptr<EventLoop::Watch> eventWatch_ KEL_ON(queue_);
+  std::unique_ptr<EventLoop::Watch> mountWatch_ KEL_ON(queue_);
+  std::chrono::steady_clock::time_point lookStart_ KEL_ON(queue_);
+  std::chrono::steady_clock::time_point lastSaving_ KEL_ON(queue_);
+  std::chrono::steady_clock::duration lastLook_ KEL_ON(queue_){};
+  bool isLooking_ KEL_ON(queue_) = false;  // or about to
+  bool isSavingScheduled_ KEL_ON(queue_) = false;
 
   std::atomic<bool> isClosing_ = false;
   std::atomic<bool> isWriting_ = false;
   Group writing_;
-  SerialQueue queue_;
+  SerialQueue queue_;  // the last, so that it ends before what its tasks touch
 };
 
 }  // namespace kel::platform

@@ -2,17 +2,14 @@
 
 namespace kel::platform {
 
-bool JournalSubscription::deliver(const std::shared_ptr<JournalSubscription>& subscription,
-                                  std::vector<JournalEvent> events, EventID position) {
-  subscription->position_ = position;
+void JournalSubscription::deliver(const std::shared_ptr<JournalSubscription>& subscription,
+                                  std::vector<JournalEvent> events) {
   // Handed over while the subscription cannot be closed: its queue is still there.
-  return subscription->queue_.with([&](SerialQueue* queue) {
-    if (!queue) return false;
-    if (events.empty()) return true;
+  subscription->queue_.with([&](SerialQueue* queue) {
+    if (!queue || events.empty()) return;
     queue->async([subscription, events = std::move(events)] {
       if (subscription->hasQueue()) subscription->callback_(events);
     });
-    return true;
   });
 }
 

@@ -16,10 +16,7 @@ class JournalSubscription {
  public:
   JournalSubscription(JournalCallback callback, std::vector<std::string> paths, EventID since,
                       bool watchesRoot)
-      : callback_(std::move(callback)),
-        paths_(std::move(paths)),
-        watchesRoot_(watchesRoot),
-        position_(since) {}
+      : callback_(std::move(callback)), paths_(std::move(paths)), since_(since), watchesRoot_(watchesRoot) {}
 
   /// Before the first event.
   void setQueue(SerialQueue& queue) { queue_.set(&queue); }
@@ -29,20 +26,18 @@ class JournalSubscription {
   void close() { queue_.set(nullptr); }
 
   const std::vector<std::string>& paths() const { return paths_; }
+  EventID since() const { return since_; }
   bool watchesRoot() const { return watchesRoot_; }
 
-  /// The position up to which events were delivered; only on the journal's queue.
-  EventID position() const { return position_; }
-
-  /// On the journal's queue; the events reach up to `position`. False when it was closed.
-  static bool deliver(const std::shared_ptr<JournalSubscription>& subscription,
-                      std::vector<JournalEvent> events, EventID position);
+  /// Hands the events to the subscription's queue, unless it was closed. Any thread.
+  static void deliver(const std::shared_ptr<JournalSubscription>& subscription,
+                      std::vector<JournalEvent> events);
 
  private:
   const JournalCallback callback_;
   const std::vector<std::string> paths_;
+  const EventID since_;
   const bool watchesRoot_;
-  EventID position_;
   Guarded<SerialQueue*> queue_;
 };
 

@@ -62,6 +62,7 @@ void EventLoop::finish() {
 
 void EventLoop::run() {
   currentLoop() = this;
+  assertCurrent();
   for (;;) {
     Round round = nextRound();
     if (round.finished) break;

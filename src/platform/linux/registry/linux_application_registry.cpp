@@ -45,7 +45,7 @@ void LinuxApplicationRegistry::seed(std::function<void()> done) {
 }
 
 LinuxApplicationRegistry::Applications LinuxApplicationRegistry::current() {
-  const std::lock_guard lock(scanning_);
+  const MutexLock lock(scanning_);
   if (!lastScanHolds()) last_ = scan();
   return last_.applications;
 }
@@ -62,7 +62,9 @@ LinuxApplicationRegistry::Scan LinuxApplicationRegistry::scan() {
   ApplicationWalk walk = walkRoots();
   const std::size_t count = walk.applications.size();
   std::vector<Look> looks(count);
-  queue_.apply(count, [&](std::size_t index) { looks[index] = lookAt(walk.applications[index].path); });
+  queue_.apply(count, [&, memory = memory_](std::size_t index) {
+    looks[index] = lookAt(walk.applications[index].path, *memory);
+  });
 
   Scan result;
   RememberedApplications settled;
@@ -101,10 +103,11 @@ LinuxApplicationRegistry::Outsider LinuxApplicationRegistry::Outsider::at(const 
   return {path, platform::isDirectory(path), informationStatus(path).status};
 }
 
-LinuxApplicationRegistry::Look LinuxApplicationRegistry::lookAt(const std::string& application) const {
+LinuxApplicationRegistry::Look LinuxApplicationRegistry::lookAt(const std::string& application,
+                                                                const RememberedApplications& memory) const {
   const InformationStatus before = informationStatus(application);
-  const auto known = memory_->find(application);
-  if (before.isKnown && known != memory_->end() && known->second.information == before.status)
+  const auto known = memory.find(application);
+  if (before.isKnown && known != memory.end() && known->second.information == before.status)
     return {known->second, true, before.isLink};
 
   Look look{{before.status, 0}, before.isKnown, before.isLink};
@@ -122,8 +125,8 @@ void LinuxApplicationRegistry::remember(RememberedApplications settled) {
   memory_ = std::make_shared<const RememberedApplications>(std::move(settled));
   databaseIsUnusable_ = false;
   if (!database_) return;
-  const bool isWriting = unwritten_.with([this](Unwritten& unwritten) {
-    unwritten.memory = memory_;
+  const bool isWriting = unwritten_.with([memory = memory_](Unwritten& unwritten) {
+    unwritten.memory = memory;
     return std::exchange(unwritten.isWriting, true);
   });
   if (!isWriting) background_.async(queue_, [this] { writeDatabase(); });
