@@ -12,8 +12,9 @@ class ByteWriter;
 
 enum class EntryKind : std::uint8_t { Unknown, File, Directory, Link, Other };
 
-/// What the kernel says about an entry. Times are nanoseconds since the epoch and are only ever compared for
-/// equality: clocks are set back. Of an unknown entry `size` is the error number that says why.
+/// The status of a directory entry: what the kernel tells about it without opening it, as far as that helps
+/// to see later whether the entry is still the same. Times are nanoseconds since the epoch and are only ever
+/// compared for equality: clocks are set back. Of an unknown entry `size` is the error number that says why.
 struct EntryStatus {
   EntryKind kind = EntryKind::Unknown;
   bool hasOtherNames = false;  ///< further hard links, through which it can change unseen

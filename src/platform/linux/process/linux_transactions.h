@@ -26,9 +26,10 @@ class LinuxTransactions final : public Transactions {
   void close() override;
 
   /// Reports from here on, on a thread of its own: at once that the process is ready, and the count whenever
-  /// it is another than the launcher heard last, a few dozen times a second at most. While the launcher takes
-  /// no more a report is kept back, so that the last one is true; one that nobody listens for is made up for
-  /// by the next. Once.
+  /// it is another than the launcher heard last, a few dozen times a second at most. While the launcher's
+  /// queue is full a report is tried again with the count of then, so that the last one it gets is true.
+  /// While nobody listens reports are lost; the next one that is heard says that the process is ready, too.
+  /// Once.
   void trackActivity();
 
  private:

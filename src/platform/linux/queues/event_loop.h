@@ -67,8 +67,8 @@ class KEL_CAPABILITY("loop") EventLoop : public std::enable_shared_from_this<Eve
 
   bool isCurrent() const;
 
-  /// States that the caller runs on the loop's thread, or that this thread has ended: nobody else can be at
-  /// the loop's things. Checked in debug builds.
+  /// States that the caller may touch what belongs to the loop: it runs on the loop's thread, or that thread
+  /// has ended, so that nobody else runs there. Checked in debug builds.
   void assertCurrent() const KEL_ASSERTS_CAPABILITY(this);
 
   /// Calls `callback` with the epoll events of `descriptor`, which stays open while it is watched, as long as
