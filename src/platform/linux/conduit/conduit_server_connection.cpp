@@ -10,6 +10,28 @@
 #include "platform/linux/queues/while_alive.h"
 #include "property_lists/property_list.h"
 
+// How a connection lives, what it may cost and how it ends.
+//
+// The acceptor opens it; until `start` the peer's going is all that is watched for, and nothing is read. From
+// then on every round is alike, whatever began it (bytes came, there is room to send, an answer is ready,
+// time passed): frames are taken from the decoder as long as `mayTake` allows, then the watch is set to what
+// is worth waiting for. A request is in flight from there until its message is answered or destroyed, on
+// whichever thread that happens; `settle` brings it back to the loop, once for each, with the bytes of the
+// answer.
+//
+// What a peer costs is counted where it arises: requests in flight, bytes of answers not taken. Either at its
+// limit stops the reading, so the kernel's buffers fill up and the peer waits; nothing is dropped for it. One
+// timer compares the bytes that moved with those of an interval ago. It runs only while the peer is the one
+// to act: who is kept waiting by us is never blamed for silence.
+//
+// The end has two steps. `breakOff` may be called from anywhere, also deep inside the handler: from there on
+// nothing is read or sent. `finish`, a task of its own, closes the socket, lets the acceptor forget the
+// connection and tells the handler. `shut` is the acceptor's own end, which tells nobody.
+//
+// Never happens: an event before `start` or after the last one; one request delivered inside the delivery of
+// another (an answer given at once comes back to `takeRequests`, which is then at work); an answer to a peer
+// that did not ask for it, since a message knows its own connection, weakly, and is answered into nothing
+// when that is gone.
 namespace kel::platform {
 
 namespace {

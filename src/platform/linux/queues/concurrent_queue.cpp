@@ -10,6 +10,19 @@
 #include "platform/linux/queues/thread.h"
 #include "platform/work_queue.h"
 
+// How `apply` ends, wherever it is called. A caller that only waited would hold up a pool whose threads all
+// call `apply` from their tasks: each would wait for tasks that no thread is left to run. So the caller draws
+// indices too, and could do all of the work alone; the tasks it queues are an offer to whoever is free. They
+// share one counter, from which everybody draws the next index, so that a slow call holds up nobody else's
+// share.
+//
+// The caller returns when every index is done. It waits for calls that some thread is in the middle of, never
+// for a task in the queue. Those of its tasks that begin later find no index left and go. The state they look
+// at is shared for their sake; the work itself is the caller's, and nobody without an index touches it.
+//
+// Never happens: a wait in a circle, as a call waits only for calls that began after it, further down; a
+// result that the caller does not see, as each participant adds to `done` under the lock that the caller
+// takes to read it.
 namespace kel::platform {
 
 struct ConcurrentQueue::Pool {

@@ -7,6 +7,24 @@
 #include "platform/linux/journal/entry_look.h"
 #include "platform/linux/registry/application_information.h"
 
+// What is remembered, from the cheapest answer to the dearest. The last scan is the answer itself, as long as
+// the change log tells of nothing below the roots since the position that was taken before that scan.
+// Outsiders are compared each time: applications and information dictionaries behind links, which change
+// where no root is. Else the folders are listed, and each application looked at. The memory holds what its
+// dictionary said and the status that it had then; with the same status now it is not read. The database is
+// the memory on disk, for the next process.
+//
+// A look is settled when every later change of the dictionary must show in its status: the status could be
+// had, the last change is longer ago than the file system's clock is coarse, and nothing changed while it was
+// read. Only settled looks are remembered. One that is not, like a folder that could not be listed, leaves
+// the answer good for this once: the scan keeps no position, so that the next query scans again.
+//
+// One scan runs at a time; who asks meanwhile waits and mostly finds it good enough. The database is written
+// in the background, one write at a time and of the newest memory only.
+//
+// Never happens: an answer that is older than a change that came before the question (the position is from
+// before the scan, so what changes during it counts as later); a dictionary that is taken for unchanged
+// because two changes fell into one tick of the clock.
 namespace kel::platform {
 
 LinuxApplicationRegistry::LinuxApplicationRegistry(FileSystem& files, SystemLog& log, ConcurrentQueue& queue,
