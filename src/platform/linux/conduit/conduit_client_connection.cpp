@@ -64,6 +64,7 @@ bool ConduitClientConnection::send(std::vector<SharedSlice> frame) {
 ConduitReply ConduitClientConnection::receive(std::uint64_t tag) {
   for (;;) {
     if (const std::optional<Frame> frame = decoder_.next()) {
+      // Requests go one by one: an answer to another one means that the server is at fault.
       if (frame->tag != tag) break;
       if (frame->kind == FrameKind::Dropped) return fail(ConduitError::Kind::ConnectionInterrupted);
       PropertyListReading reading = readBinaryPropertyList(frame->payload);
@@ -77,6 +78,7 @@ ConduitReply ConduitClientConnection::receive(std::uint64_t tag) {
     if (count <= 0) break;
     decoder_.received(static_cast<std::size_t>(count));
   }
+  // Whatever comes later could not be told from the answer to a later request.
   socket_.reset();
   return fail(ConduitError::Kind::ConnectionInterrupted);
 }

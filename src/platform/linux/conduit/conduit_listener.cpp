@@ -70,6 +70,7 @@ void ConduitAcceptor::acceptSome() {
     }
     const int error = errno;
     if (error == EAGAIN || error == EWOULDBLOCK) return;
+    // A peer that has gone before its turn is not the socket's fault.
     if (error == EINTR || error == ECONNABORTED) continue;
     if (error != EMFILE && error != ENFILE) {
       report(error);
@@ -89,6 +90,8 @@ void ConduitAcceptor::acceptSome() {
 ConduitAcceptor::Shortage ConduitAcceptor::giveUpOne() {
   if (!reserve_) reserve_ = spareDescriptor();
   if (!reserve_) return Shortage::Helpless;
+  // A connection that nobody can accept keeps the socket ready and its peer waiting: with the descriptor that
+  // is kept for this it is accepted to be closed.
   reserve_.reset();
   // The kernel looks for a free number before it looks for a connection: there may be none.
   OwnedDescriptor socket(accept4(endpoint_->get(), nullptr, nullptr, SOCK_CLOEXEC));
