@@ -97,7 +97,7 @@ class KELServer {
   platform::NotificationSeeds::Token notificationToken_ = 0;
 
   const std::unique_ptr<KELDataStore> protectedDatastore_ KEL_TARGET_ON(datastoreQueue_);
-  std::atomic<std::uint32_t> currentGenCount_ = 0;          // raised only on datastoreQueue_
+  std::atomic<std::uint32_t> currentGenCount_ = 0;  // raised only on datastoreQueue_
   std::atomic<std::uint64_t> notificationSeed_ = 0;
   std::mutex changingList_;  // held while the list is compared, set and handed to publication
   platform::Guarded<platform::SharedBytes> currentData_;

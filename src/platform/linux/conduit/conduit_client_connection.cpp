@@ -21,19 +21,19 @@ ConduitError errorObject(ConduitError::Kind kind) {
 }  // namespace
 
 void ConduitClientConnection::setEventHandler(ConduitEventHandler handler) {
-  const std::lock_guard lock(exchanging_);
+  const MutexLock lock(exchanging_);
   handler_ = std::make_shared<const ConduitEventHandler>(std::move(handler));
 }
 
 void ConduitClientConnection::start() {
-  const std::lock_guard lock(exchanging_);
+  const MutexLock lock(exchanging_);
   if (!path_.empty()) socket_ = connectToEndpoint(path_, 0);
   if (!socket_) fail(ConduitError::Kind::ConnectionInvalid);
 }
 
 ConduitReply ConduitClientConnection::sendAndWait(const PropertyListValue& contents) {
   assert(!queue_.isCurrent());
-  const std::lock_guard lock(exchanging_);
+  const MutexLock lock(exchanging_);
   return exchange(contents);
 }
 
@@ -64,6 +64,7 @@ bool ConduitClientConnection::send(std::vector<SharedSlice> frame) {
 ConduitReply ConduitClientConnection::receive(std::uint64_t tag) {
   for (;;) {
     if (const std::optional<Frame> frame = decoder_.next()) {
+      // Requests go one by one: an answer to another one means that the server is at fault.
       if (frame->tag != tag) break;
       if (frame->kind == FrameKind::Dropped) return fail(ConduitError::Kind::ConnectionInterrupted);
       PropertyListReading reading = readBinaryPropertyList(frame->payload);
@@ -77,6 +78,7 @@ ConduitReply ConduitClientConnection::receive(std::uint64_t tag) {
     if (count <= 0) break;
     decoder_.received(static_cast<std::size_t>(count));
   }
+  // Whatever comes later could not be told from the answer to a later request.
   socket_.reset();
   return fail(ConduitError::Kind::ConnectionInterrupted);
 }

@@ -1,13 +1,12 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <string>
 
 #include "platform/conduit.h"
 #include "platform/linux/conduit/conduit_frames.h"
 #include "platform/linux/files/owned_descriptor.h"
-#include "platform/linux/queues/event_loop.h"
+#include "platform/linux/queues/mutex.h"
 
 namespace kel::platform {
 
@@ -29,20 +28,20 @@ class ConduitClientConnection final : public ConduitConnection {
   ConduitReply sendAndWait(const PropertyListValue& contents) override;
 
  private:
-  ConduitReply exchange(const PropertyListValue& contents);
-  bool send(std::vector<SharedSlice> frame);
-  ConduitReply receive(std::uint64_t tag);
-  ConduitReply fail(ConduitError::Kind kind);
+  ConduitReply exchange(const PropertyListValue& contents) KEL_RUNS_ON(exchanging_);
+  bool send(std::vector<SharedSlice> frame) KEL_RUNS_ON(exchanging_);
+  ConduitReply receive(std::uint64_t tag) KEL_RUNS_ON(exchanging_);
+  ConduitReply fail(ConduitError::Kind kind) KEL_RUNS_ON(exchanging_);
 
   const std::string path_;
   SerialQueue& queue_;
 
-  // Held over a whole exchange, which is all that it is for.
-  std::mutex exchanging_;
-  OwnedDescriptor socket_;  // none before `start` and when the connection is over
-  FrameDecoder decoder_{{FrameKind::Reply, FrameKind::Dropped}, largestReply};
-  std::uint64_t lastTag_ = 0;
-  std::shared_ptr<const ConduitEventHandler> handler_;  // null when it got its event
+  // Held until a request has its answer, also while the server works on it: so requests go one by one.
+  Mutex exchanging_;
+  OwnedDescriptor socket_ KEL_ON(exchanging_);  // none before `start` and when the connection is over
+  FrameDecoder decoder_ KEL_ON(exchanging_){{FrameKind::Reply, FrameKind::Dropped}, largestReply};
+  std::uint64_t lastTag_ KEL_ON(exchanging_) = 0;
+  std::shared_ptr<const ConduitEventHandler> handler_ KEL_ON(exchanging_);  // null once it was told the error
 };
 
 }  // namespace kel::platform

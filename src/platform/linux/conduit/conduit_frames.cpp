@@ -4,6 +4,19 @@
 #include <concepts>
 #include <utility>
 
+// Framing. One buffer holds, from its start: what was handed out already, the bytes from `begin_` to `end_`
+// that were not, and room for more. A frame is handed out where it lies, so that a payload is never copied;
+// that is why asking for room, which moves the rest to the front, ends the life of the last one.
+//
+// The buffer grows by what arrived, not by what a header promises: at most to twice its size, and no further
+// than the frame at hand needs. A header that claims a gigabyte costs 4 KiB until the gigabyte comes.
+// Doubling keeps the copying in proportion to the bytes; and the rest that moves to the front is always less
+// than one frame. Once all is handed out a buffer that a large frame made large is given back, for
+// connections are idle most of the time.
+//
+// A header is judged as soon as its 16 bytes are there, before the payload: an unknown kind, a length that
+// its kind cannot have, an answer that belongs to no request. Behind such a header nobody knows where the
+// next frame begins, so there is none: the error stays.
 namespace kel::platform {
 
 namespace {

@@ -12,6 +12,7 @@
 #include "platform/linux/files/files.h"
 #include "platform/linux/process/linux_process.h"
 #include "platform/linux/queues/serial_queue.h"
+#include "platform/linux/queues/while_alive.h"
 
 namespace kel::platform {
 
@@ -46,12 +47,8 @@ ConduitAcceptor::ConduitAcceptor(const ConduitServerContext& context, EndpointSo
 void ConduitAcceptor::open() {
   loop_.assertCurrent();
   if (!endpoint_) return;
-  watch_ = loop_.watch(endpoint_->get(), EPOLLIN, [weak = weak_from_this()](std::uint32_t) {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    self->acceptSome();
-  });
+  watch_ = loop_.watch(endpoint_->get(), EPOLLIN,
+                       whileAlive(weak_from_this(), loop_, &ConduitAcceptor::acceptSome));
   if (!watch_) report(errno);
 }
 
@@ -74,6 +71,7 @@ void ConduitAcceptor::acceptSome() {
     }
     const int error = errno;
     if (error == EAGAIN || error == EWOULDBLOCK) return;
+    // A peer that has gone before its turn is not the socket's fault.
     if (error == EINTR || error == ECONNABORTED) continue;
     if (error != EMFILE && error != ENFILE) {
       report(error);
@@ -93,6 +91,8 @@ void ConduitAcceptor::acceptSome() {
 ConduitAcceptor::Shortage ConduitAcceptor::giveUpOne() {
   if (!reserve_) reserve_ = spareDescriptor();
   if (!reserve_) return Shortage::Helpless;
+  // A connection that nobody can accept keeps the socket ready and its peer waiting: with the descriptor that
+  // is kept for this it is accepted to be closed.
   reserve_.reset();
   // The kernel looks for a free number before it looks for a connection: there may be none.
   OwnedDescriptor socket(accept4(endpoint_->get(), nullptr, nullptr, SOCK_CLOEXEC));
@@ -124,16 +124,14 @@ void ConduitAcceptor::admit(OwnedDescriptor socket) {
   const std::uint64_t age = ++lastConnection_;
   auto peer = LinuxPeerProcess::ofSocket(socket.get(), credentials.pid);
   const auto connection = std::make_shared<ConduitServerConnection>(
-      context_, std::move(socket), std::move(peer), [weak = weak_from_this(), age](ConduitServerConnection&) {
-        const auto self = weak.lock();
-        if (!self) return;
-        self->loop_.assertCurrent();
-        self->connections_.erase(age);
-      });
+      context_, std::move(socket), std::move(peer),
+      whileAlive(weak_from_this(), loop_, &ConduitAcceptor::forget, age));
   if (!connection->open()) return;
   connections_.emplace(age, connection);
   handler_(std::shared_ptr<ConduitConnection>(connection));
 }
+
+void ConduitAcceptor::forget(std::uint64_t age) { connections_.erase(age); }
 
 bool ConduitAcceptor::makeRoom() {
   if (connections_.size() < mostConnections_) return true;
@@ -148,12 +146,12 @@ void ConduitAcceptor::rest() {
   if (!watch_) return;
   // The socket stays ready, so that watching on would keep the loop busy.
   watch_->setEvents(0);
-  context_.clock.after(context_.queue, restInterval, [weak = weak_from_this()] {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    if (self->watch_) self->watch_->setEvents(EPOLLIN);
-  });
+  context_.clock.after(context_.queue, restInterval,
+                       whileAlive(weak_from_this(), loop_, &ConduitAcceptor::resume));
+}
+
+void ConduitAcceptor::resume() {
+  if (watch_) watch_->setEvents(EPOLLIN);
 }
 
 void ConduitAcceptor::report(int error) {
@@ -163,9 +161,7 @@ void ConduitAcceptor::report(int error) {
 LinuxConduitListener::LinuxConduitListener(const ConduitServerContext& context, EndpointSocket endpoint,
                                            ConduitEventHandler handler)
     : acceptor_(std::make_shared<ConduitAcceptor>(context, std::move(endpoint), std::move(handler))) {
-  context.queue.async([weak = std::weak_ptr(acceptor_)] {
-    if (const auto acceptor = weak.lock()) acceptor->open();
-  });
+  context.queue.async(whileAlive(std::weak_ptr(acceptor_), eventLoop(context.queue), &ConduitAcceptor::open));
 }
 
 }  // namespace kel::platform

@@ -31,7 +31,9 @@ class ConduitAcceptor : public std::enable_shared_from_this<ConduitAcceptor> {
   Shortage giveUpOne() KEL_RUNS_ON(loop_);
   void admit(OwnedDescriptor socket) KEL_RUNS_ON(loop_);
   bool makeRoom() KEL_RUNS_ON(loop_);
+  void forget(std::uint64_t age) KEL_RUNS_ON(loop_);
   void rest() KEL_RUNS_ON(loop_);
+  void resume() KEL_RUNS_ON(loop_);
   void report(int error) KEL_RUNS_ON(loop_);
 
   // Fixed after construction.

@@ -8,8 +8,31 @@
 
 #include "platform/linux/conduit/conduit_server_message.h"
 #include "platform/linux/queues/serial_queue.h"
+#include "platform/linux/queues/while_alive.h"
 #include "property_lists/property_list.h"
 
+// How a connection lives, what it may cost and how it ends.
+//
+// The acceptor opens it; until `start` the peer's going is all that is watched for, and nothing is read. From
+// then on every round is alike, whatever began it (bytes came, there is room to send, an answer is ready,
+// time passed): frames are taken from the decoder as long as `mayTake` allows, then the watch is set to what
+// is worth waiting for. A request is in flight from there until its message is answered or destroyed, on
+// whichever thread that happens; `settle` brings it back to the loop, once for each, with the bytes of the
+// answer.
+//
+// What a peer costs is counted where it arises: requests in flight, bytes of answers not taken. Either at its
+// limit stops the reading, so the kernel's buffers fill up and the peer waits; nothing is dropped for it. One
+// timer compares the bytes that moved with those of an interval ago. It runs only while the peer is the one
+// to act: who is kept waiting by us is never blamed for silence.
+//
+// The end has two steps. `breakOff` may be called from anywhere, also deep inside the handler: from there on
+// nothing is read or sent. `finish`, a task of its own, closes the socket, lets the acceptor forget the
+// connection and tells the handler. `shut` is the acceptor's own end, which tells nobody.
+//
+// Never happens: an event before `start` or after the last one; one request delivered inside the delivery of
+// another (an answer given at once comes back to `takeRequests`, which is then at work); an answer to a peer
+// that did not ask for it, since a message knows its own connection, weakly, and is answered into nothing
+// when that is gone.
 namespace kel::platform {
 
 namespace {
@@ -27,7 +50,7 @@ constexpr int sendsInARow = 8;           // then the other connections have thei
 
 ConduitServerConnection::ConduitServerConnection(const ConduitServerContext& context, OwnedDescriptor socket,
                                                  std::shared_ptr<const LinuxPeerProcess> peer,
-                                                 std::function<void(ConduitServerConnection&)> gone)
+                                                 std::function<void()> gone)
     : context_(context),
       keptLoop_(eventLoop(context.queue).shared_from_this()),
       loop_(*keptLoop_),
@@ -37,12 +60,8 @@ ConduitServerConnection::ConduitServerConnection(const ConduitServerContext& con
 
 bool ConduitServerConnection::open() {
   loop_.assertCurrent();
-  watch_ = loop_.watch(socket_.get(), interest_, [weak = weak_from_this()](std::uint32_t events) {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    self->serve(events);
-  });
+  watch_ = loop_.watch(socket_.get(), interest_,
+                       whileAlive(weak_from_this(), loop_, &ConduitServerConnection::serve));
   return watch_ != nullptr;
 }
 
@@ -147,8 +166,8 @@ void ConduitServerConnection::take(const Frame& frame) {
   PropertyListReading reading = readBinaryPropertyList(frame.payload, limits);
   if (!reading.value) return refuse("malformed message: " + reading.error);
   ++inFlight_;
-  const ConduitEvent event = std::shared_ptr<ConduitMessage>(
-      std::make_shared<ConduitServerMessage>(weak_from_this(), frame.tag, std::move(*reading.value)));
+  const ConduitEvent event = std::shared_ptr<ConduitMessage>(std::make_shared<ConduitServerMessage>(
+      weak_from_this(), keptLoop_, frame.tag, std::move(*reading.value)));
   const std::shared_ptr<const ConduitEventHandler> handler = handler_;
   if (handler && *handler) (*handler)(event);
 }
@@ -197,12 +216,8 @@ void ConduitServerConnection::watchProgress() {
   timerRuns_ = true;
   receivedBefore_ = received_;
   sentBefore_ = sent_;
-  context_.clock.after(context_.queue, progressInterval, [weak = weak_from_this()] {
-    const auto self = weak.lock();
-    if (!self) return;
-    self->loop_.assertCurrent();
-    self->checkProgress();
-  });
+  context_.clock.after(context_.queue, progressInterval,
+                       whileAlive(weak_from_this(), loop_, &ConduitServerConnection::checkProgress));
 }
 
 void ConduitServerConnection::checkProgress() {
@@ -239,7 +254,7 @@ void ConduitServerConnection::finish() {
   const auto handler = handler_;
   shut();
   handler_ = handler;
-  gone_(*this);
+  gone_();
   if (started_) deliverInvalid();
 }
 

@@ -34,8 +34,7 @@ class ConduitServerConnection final : public ConduitConnection,
   /// Takes a connected, non-blocking `socket`. `gone` is called once, before the last event, when the
   /// connection has ended of itself.
   ConduitServerConnection(const ConduitServerContext& context, OwnedDescriptor socket,
-                          std::shared_ptr<const LinuxPeerProcess> peer,
-                          std::function<void(ConduitServerConnection&)> gone);
+                          std::shared_ptr<const LinuxPeerProcess> peer, std::function<void()> gone);
 
   /// Begins to watch for the peer's going; false when the kernel refuses. Once, before everything else.
   bool open();
@@ -82,7 +81,7 @@ class ConduitServerConnection final : public ConduitConnection,
   const std::shared_ptr<EventLoop> keptLoop_;
   EventLoop& loop_;
   const std::shared_ptr<const LinuxPeerProcess> peer_;
-  const std::function<void(ConduitServerConnection&)> gone_;
+  const std::function<void()> gone_;
 
   OwnedDescriptor socket_ KEL_ON(loop_);
   std::unique_ptr<EventLoop::Watch> watch_ KEL_ON(loop_);

@@ -52,6 +52,7 @@ OwnedDescriptor bindAndListen(const std::string& path) {
 
 }  // namespace
 
+// Under the lock still, so that it cannot be the file of a server that has just taken over.
 EndpointSocket::~EndpointSocket() {
   if (socket_ && !path_.empty()) unlink(path_.c_str());
 }
@@ -59,6 +60,8 @@ EndpointSocket::~EndpointSocket() {
 EndpointBinding bindEndpoint(const std::string& path) {
   OwnedDescriptor lock = openFile(AT_FDCWD, path + ".lock", O_RDWR | O_CREAT | O_NOFOLLOW | O_NONBLOCK, 0600);
   if (!lock) return failed(path + ".lock");
+  // A lock, not the socket file, decides: between finding a dead server's file and replacing it another
+  // server could have put its own there.
   while (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
     if (errno == EWOULDBLOCK) return servedElsewhere(path);
     if (errno != EINTR) return failed(path + ".lock");

@@ -2,7 +2,7 @@
 
 #include <optional>
 #include <string>
-#include <string_view>
+#include <utility>
 
 #include "platform/linux/files/owned_descriptor.h"
 
@@ -41,21 +41,6 @@ struct EndpointBinding {
 /// it keeps other servers out for the socket's life; the file that a dead server left is replaced, a live
 /// one's never.
 EndpointBinding bindEndpoint(const std::string& path);
-
-/// The sockets that the service launcher passed to this process, in consecutive descriptors.
-struct LauncherSockets {
-  int first = 3;
-  int count = 0;
-  std::optional<std::string> names;  ///< separated by colons
-};
-
-/// Reads LISTEN_PID, LISTEN_FDS and LISTEN_FDNAMES and removes them from the environment; no sockets when
-/// they are absent, malformed or meant for another process. Before other threads use the environment.
-LauncherSockets takeLauncherSockets();
-
-/// The one of `sockets` that listens for Unix stream connections and, where names were passed, bears `name`;
-/// made non-blocking. All of them are set to close on exec.
-std::optional<EndpointSocket> findLauncherSocket(const LauncherSockets& sockets, std::string_view name);
 
 /// Connects to the socket file `path`, with the flags for the new socket (SOCK_NONBLOCK or none). None, with
 /// errno set, when that fails: ECONNREFUSED or ENOENT mean that nobody listens. A blocking one waits for a

@@ -1,3 +1,5 @@
+#include "platform/linux/conduit/launcher_sockets.h"
+
 #include <charconv>
 #include <cstdlib>
 #include <fcntl.h>
@@ -5,8 +7,6 @@
 #include <unistd.h>
 #include <utility>
 #include <vector>
-
-#include "platform/linux/conduit/endpoint_socket.h"
 
 namespace kel::platform {
 
@@ -18,6 +18,7 @@ std::optional<std::string> takeVariable(const char* name) {
   const char* value = std::getenv(name);
   std::optional<std::string> result;
   if (value) result = value;
+  // A child that inherited it would take our descriptors' numbers for sockets of its own.
   unsetenv(name);
   return result;
 }
@@ -46,6 +47,7 @@ bool hasOption(int descriptor, int option, int expected) {
   return getsockopt(descriptor, SOL_SOCKET, option, &value, &length) == 0 && value == expected;
 }
 
+/// What the launcher is told to pass is the user's to configure, and may be anything.
 bool listensForUnixStreams(int descriptor) {
   return hasOption(descriptor, SO_DOMAIN, AF_UNIX) && hasOption(descriptor, SO_TYPE, SOCK_STREAM) &&
          hasOption(descriptor, SO_ACCEPTCONN, 1);
@@ -74,6 +76,7 @@ std::optional<EndpointSocket> findLauncherSocket(const LauncherSockets& sockets,
     const auto index = static_cast<std::size_t>(i);
     if (sockets.names && (index >= names.size() || names[index] != name)) continue;
     if (!listensForUnixStreams(descriptor)) continue;
+    // Another process that waits in the same socket may accept a connection first: accepting must not wait.
     const int flags = fcntl(descriptor, F_GETFL);
     if (flags < 0 || fcntl(descriptor, F_SETFL, flags | O_NONBLOCK) != 0) continue;
     found.emplace(OwnedDescriptor(descriptor));

@@ -4,6 +4,7 @@
 
 #include "platform/linux/conduit/conduit_client_connection.h"
 #include "platform/linux/conduit/conduit_listener.h"
+#include "platform/linux/conduit/endpoint_socket.h"
 
 namespace kel::platform {
 
@@ -22,6 +23,7 @@ ConduitListening LinuxConduit::listen(std::string_view name, SerialQueue& queue,
   const LauncherSockets passed = environment_.launcherSockets();
   std::optional<EndpointSocket> socket = findLauncherSocket(passed, name);
   if (!socket) {
+    // Told, because who connects to the launcher's socket waits in vain while this server has one of its own.
     if (passed.count > 0) {
       log_.write("conduit: none of the launcher's sockets listens for " + std::string(name));
     }

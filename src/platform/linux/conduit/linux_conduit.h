@@ -4,7 +4,7 @@
 
 #include "platform/clock.h"
 #include "platform/conduit.h"
-#include "platform/linux/conduit/endpoint_socket.h"
+#include "platform/linux/conduit/launcher_sockets.h"
 #include "platform/linux/files/runtime_directory.h"
 #include "platform/system_log.h"
 

@@ -23,6 +23,7 @@ void OutgoingBytes::clear() {
 }
 
 OutgoingBytes::Result OutgoingBytes::sendSome(int socket) {
+  // Enough to fill a socket's buffer in one call, mostly; what is left goes with the next.
   std::array<iovec, 64> parts;
   const std::size_t count = std::min(parts.size(), slices_.size());
   for (std::size_t i = 0; i < count; ++i) {

@@ -9,6 +9,7 @@
 
 namespace kel::platform {
 
+// `strerror` would speak the user's language, into a buffer that threads share.
 std::string errorText(int errorNumber) {
   const char* text = strerrordesc_np(errorNumber);
   return text ? text : "Error " + std::to_string(errorNumber);
@@ -36,6 +37,7 @@ bool writeWhole(int descriptor, BytesView bytes) {
   while (!bytes.empty()) {
     const ssize_t written = write(descriptor, bytes.data(), bytes.size());
     if (written < 0 && errno == EINTR) continue;
+    // Should not happen, but trying again without end would be worse than a wrong reason.
     if (written == 0) errno = ENOSPC;
     if (written <= 0) return false;
     bytes = bytes.subspan(static_cast<std::size_t>(written));
@@ -51,6 +53,8 @@ bool isRegularFile(int descriptor, struct stat& status) {
 }
 
 std::optional<Bytes> readFile(int directory, const std::string& path, std::size_t largest) {
+  // A FIFO without a writer would keep us in `open`; a terminal would become the one that controls this
+  // process.
   const OwnedDescriptor file = openFile(directory, path, O_RDONLY | O_NONBLOCK | O_NOCTTY);
   struct stat status {};
   if (!file || !isRegularFile(file.get(), status)) return std::nullopt;
@@ -58,6 +62,7 @@ std::optional<Bytes> readFile(int directory, const std::string& path, std::size_
   std::size_t length = 0;
   // What states no size is the system's, and some of that is given in one piece or not at all.
   constexpr std::size_t piece = 4096;
+  // One byte more than wanted, which shows that the file is longer than it said, or than is allowed.
   Bytes bytes(std::min(size > 0 ? size : piece, largest) + 1);
   while (size <= largest && length <= largest) {
     const ssize_t count = read(file.get(), bytes.data() + length, bytes.size() - length);
@@ -88,6 +93,7 @@ bool makeDirectories(const std::string& path) {
   if (!isWhole(path)) return false;
   if (isDirectory(path)) return true;
   for (std::size_t end = path.find('/', 1); end != std::string::npos; end = path.find('/', end + 1)) {
+    // Somebody else may be making the same path at the same time.
     if (mkdir(path.substr(0, end).c_str(), 0700) != 0 && errno != EEXIST) return false;
   }
   if (mkdir(path.c_str(), 0700) == 0 || isDirectory(path)) return true;
@@ -97,6 +103,7 @@ bool makeDirectories(const std::string& path) {
 
 bool isDirectory(const std::string& path) {
   struct stat status {};
+  // Also asked between a failure and the report of its reason.
   const int kept = errno;
   const bool found = isWhole(path) && stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
   errno = kept;

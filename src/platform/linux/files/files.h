@@ -31,16 +31,16 @@ OwnedDescriptor openFile(int directory, const std::string& path, int flags, mode
 /// Writes all of `bytes`, however often the kernel takes only a part.
 bool writeWhole(int descriptor, BytesView bytes);
 
-/// Reads a whole regular file, also one of the system's that states no size, without ever waiting for one. A
-/// longer one than `largest` fails with EFBIG, a directory with EISDIR, what else is no regular file with
-/// EINVAL.
+/// The contents of a regular file, whole; also of a file in /proc or /sys, whose status says 0 bytes. Never
+/// waits for a FIFO or a device: what is no regular file fails with EINVAL, a directory with EISDIR, and a
+/// file of more than `largest` bytes with EFBIG.
 std::optional<Bytes> readFile(int directory, const std::string& path, std::size_t largest);
 
 /// The same as text, for the small files of the system.
 std::optional<std::string> readSmallFile(int directory, const std::string& path, std::size_t largest = 65536);
 
-/// True when `descriptor` is that of a regular file, whose status is then in `status`; else fails as
-/// `readFile`.
+/// True when `descriptor` is that of a regular file; `status` is then what the kernel tells about it
+/// (`fstat`). Else fails as `readFile`.
 bool isRegularFile(int descriptor, struct stat& status);
 
 struct CloseDirectory {

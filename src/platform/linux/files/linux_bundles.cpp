@@ -22,6 +22,7 @@ class LinuxBundle final : public Bundle {
 
   std::optional<std::string> resourcePath(std::string_view name, std::string_view type,
                                           std::string_view localization) override {
+    // The localization comes from whoever asks: its name must not lead out of the bundle.
     const auto below = localizedResourceName(name, type, localization);
     if (!below) return std::nullopt;
     std::string path = joinPath(path_, *below);
@@ -35,6 +36,7 @@ class LinuxBundle final : public Bundle {
     const std::string path = joinPath(path_, "Info.plist");
     DictionaryReading reading = readDictionaryFile(files_, path, largestForeignFile, bundleFileLimits);
     if (reading.dictionary) return std::move(*reading.dictionary);
+    // A directory without one is no bundle, which is common and worth no line.
     if (files_.exists(path))
       log_.write("Cannot read the information dictionary " + path + ": " + reading.error);
     return {};

@@ -14,7 +14,8 @@ namespace kel::platform {
 
 namespace {
 
-/// A file under a name of its own that becomes the one wanted by `replace`, or vanishes.
+/// A file under a name of its own that becomes the one wanted by `replace`, or vanishes. It lies in the same
+/// directory, since a rename does not lead from one file system to another.
 class TemporaryFile {
  public:
   TemporaryFile(int directory, std::string_view wanted) : directory_(directory), wanted_(wanted) {
@@ -40,6 +41,8 @@ class TemporaryFile {
   }
 
   bool replace(BytesView bytes) {
+    // Flushed before it is renamed: else the name may reach the disk before the contents, and a machine that
+    // loses power in between comes back with an empty file in place of the old one.
     if (!file_ || !writeWhole(file_.get(), bytes) || fsync(file_.get()) != 0) return false;
     file_.reset();
     if (renameat(directory_, name_.c_str(), directory_, wanted_.c_str()) != 0) return false;
@@ -62,6 +65,7 @@ std::optional<std::vector<std::string>> LinuxFileSystem::listDirectory(const std
   std::vector<std::string> names;
   std::size_t unreadable = 0;
   for (;;) {
+    // The end of the list and a failure differ in nothing but this.
     errno = 0;
     const dirent* entry = readdir(listing.get());
     if (!entry && errno != 0) return std::nullopt;
@@ -107,9 +111,11 @@ std::optional<std::string> LinuxFileSystem::writeAtomically(const std::string& p
 }
 
 std::optional<std::string> LinuxFileSystem::writePlainly(const std::string& path, BytesView bytes) {
+  // A FIFO that nobody reads would keep a blocking open waiting; this one fails.
   const OwnedDescriptor file =
       openFile(AT_FDCWD, path, O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY, 0600);
   struct stat status {};
+  // Cut only now that it is known what was opened.
   if (!file || !isRegularFile(file.get(), status) || ftruncate(file.get(), 0) != 0 ||
       !writeWhole(file.get(), bytes) || fsync(file.get()) != 0) {
     return errorLine(path, errno);

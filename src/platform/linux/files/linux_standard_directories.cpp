@@ -21,6 +21,7 @@ std::string withoutTrailingSlashes(std::string path) {
 
 std::optional<std::string> homeFromUserDatabase() {
   constexpr std::size_t largestRecord = 1 << 20;
+  // How much room a record takes only the attempt tells.
   for (std::string buffer(4096, '\0'); buffer.size() <= largestRecord; buffer.resize(buffer.size() * 2)) {
     passwd record{};
     passwd* found = nullptr;
@@ -36,6 +37,7 @@ bool isSafeForTemporaryFiles(const std::string& path) {
   const OwnedDescriptor directory = openFile(AT_FDCWD, path, O_PATH | O_DIRECTORY);
   struct stat status {};
   if (!directory || fstat(directory.get(), &status) != 0 || status.st_uid != geteuid()) return false;
+  // Where others may write the sticky bit keeps them from replacing what is ours.
   return (status.st_mode & (S_IWGRP | S_IWOTH)) == 0 || (status.st_mode & S_ISVTX) != 0;
 }
 
@@ -80,6 +82,8 @@ std::optional<std::string> LinuxStandardDirectories::absoluteVariable(const std:
 std::optional<std::string> LinuxStandardDirectories::userDirectory(const std::string& variable,
                                                                    std::string_view belowHome) {
   std::string path = absoluteVariable(variable).value_or(joinPath(homeDirectory(), belowHome));
+  // Programs run for another user commonly keep the variables of the first one, whose files they must not
+  // touch.
   struct stat status {};
   const bool exists = stat(path.c_str(), &status) == 0;
   if (exists && (!S_ISDIR(status.st_mode) || status.st_uid != geteuid())) return std::nullopt;

@@ -28,6 +28,8 @@ RuntimeDirectory makePrivateDirectory(const std::string& path) {
   } else if (errno != EEXIST) {
     return failed();
   }
+  // In /tmp anyone can make a directory of this name first. What is judged, and given its mode, is what was
+  // opened, so that nothing can be exchanged in between.
   const OwnedDescriptor directory = openFile(AT_FDCWD, path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
   struct stat status {};
   if (!directory || fstat(directory.get(), &status) != 0) return failed();

@@ -35,6 +35,7 @@ std::optional<ByteReader> ByteReader::open(BytesView file, std::string_view form
       file[format.size()] != '\n') {
     return std::nullopt;
   }
+  // Against half-written and damaged files, not against forgers: whoever can write here may do so anyway.
   const BytesView contents = file.subspan(start);
   const Digest checksum = md5(contents);
   if (!std::equal(checksum.begin(), checksum.end(), file.begin() + static_cast<std::ptrdiff_t>(start - 16))) {
@@ -82,6 +83,7 @@ BytesView ByteReader::bytes(std::size_t count) {
 
 std::size_t ByteReader::count() {
   const std::uint64_t value = number();
+  // Checked here, so that no caller reserves memory for what a few bytes only claim.
   if (value > rest_.size()) fail();
   return failed_ ? 0 : static_cast<std::size_t>(value);
 }

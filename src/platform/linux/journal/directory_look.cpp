@@ -10,6 +10,7 @@
 #include <sys/statfs.h>
 
 #include "platform/linux/files/files.h"
+#include "platform/linux/journal/entry_look.h"
 
 namespace kel::platform {
 

@@ -3,6 +3,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -37,7 +38,7 @@ struct DirectoryLook {
   int error = 0;
   EntryStatus own;
   bool ownIsRacy = false;
-  dev_t device = 0;
+  std::uint64_t device = 0;
   FileSystemTraits fileSystem;
   std::vector<std::pair<JournalNode*, EntryRecord>> recorded;  ///< known entries with another record
   std::vector<std::pair<std::string, EntryRecord>> added;

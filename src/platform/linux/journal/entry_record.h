@@ -1,9 +1,7 @@
 #pragma once
 
-#include <chrono>
 #include <cstdint>
 #include <optional>
-#include <sys/types.h>
 
 #include "property_lists/digest.h"
 
@@ -14,8 +12,9 @@ class ByteWriter;
 
 enum class EntryKind : std::uint8_t { Unknown, File, Directory, Link, Other };
 
-/// What the kernel says about an entry. Times are nanoseconds since the epoch and are only ever compared for
-/// equality: clocks are set back. Of an unknown entry `size` is the error number that says why.
+/// The status of a directory entry: what the kernel tells about it without opening it, as far as that helps
+/// to see later whether the entry is still the same. Times are nanoseconds since the epoch and are only ever
+/// compared for equality: clocks are set back. Of an unknown entry `size` is the error number that says why.
 struct EntryStatus {
   EntryKind kind = EntryKind::Unknown;
   bool hasOtherNames = false;  ///< further hard links, through which it can change unseen
@@ -42,35 +41,15 @@ struct EntryRecord {
   bool operator==(const EntryRecord&) const = default;
 };
 
-/// Looks at `name` in `directory`: at a link and at what it leads to. Of a directory only kind and inode.
-EntryRecord lookAtEntry(int directory, const char* name);
-
 /// How far the times of a file system can be trusted.
 enum class TimeStamps : std::uint8_t {
   Local,   ///< from this machine's clock
   Foreign  ///< from another machine's, which may go differently
 };
 
-/// The time that local file systems stamp changes with, in nanoseconds.
-std::int64_t timeStampNow();
-
 /// True when an entry last changed at `changed` might change again, or might have, without another stamp: it
 /// was looked at, not before `now`, within the granularity of its file system's clock.
 bool isRacy(std::int64_t changed, std::int64_t now, TimeStamps stamps);
-
-/// How to take a record.
-struct RecordTaking {
-  std::int64_t now = 0;  ///< `timeStampNow`, from before the look
-  TimeStamps stamps = TimeStamps::Local;
-  bool digestIfRacy = true;  ///< also of what a watch tells the changes of
-  std::chrono::steady_clock::time_point deadline = std::chrono::steady_clock::time_point::max();
-};
-
-/// Looks at `name` in `directory`, at a link and at what it leads to. `before` is the last record, absent for
-/// a new entry: one with a digest gets a digest again, so that the two can be compared. Never waits for a
-/// FIFO or a device and reads at most 1 MiB, and nothing after the deadline.
-EntryRecord takeRecord(int directory, const char* name, const EntryRecord* before,
-                       const RecordTaking& taking);
 
 /// True when the entry is one whose changes no watch of its directory tells: a link, or a file with further
 /// names.
@@ -78,9 +57,6 @@ bool changesUnseen(const EntryRecord& record);
 
 /// True when nothing can have changed between the two records.
 bool isUnchanged(const EntryRecord& before, const EntryRecord& now);
-
-/// The status of an open file or directory; of unknown kind when it cannot be had. `device` is set with it.
-EntryStatus statusOf(int descriptor, dev_t& device);
 
 /// How a status lies in files. What is no status fails the reader.
 void writeStatus(ByteWriter& writer, const EntryStatus& status);

@@ -17,7 +17,8 @@ namespace kel::platform {
 void JournalForest::readEvents() {
   if (!inotify_) return;
   int left = 0;
-  // Only what is there by now: who writes without end shall not keep us here.
+  // Only as much as is there now: while somebody changes files without a pause, reading until nothing is left
+  // would never end.
   if (ioctl(inotify_.get(), FIONREAD, &left) != 0 || left <= 0) return;
   const EventID id = newID_();
   alignas(inotify_event) std::array<char, 65536> buffer;
@@ -93,7 +94,8 @@ void JournalForest::noteDisappearance(JournalNode& directory, std::string_view n
   }
 }
 
-/// Who may look where may have changed below it.
+/// New permissions or another owner of a directory can let the user into places below it, or shut them off:
+/// all of it has to be looked at again.
 void JournalForest::noteAttributes(JournalNode& directory, EventID id) {
   JournalTree::markListed(directory, id);
   doubtBelow(directory);

@@ -18,7 +18,8 @@ std::size_t countBelow(const JournalNode& node, std::size_t most) {
   return count;
 }
 
-/// What becomes of the first of its kind, for the system log.
+/// The end of the lines in the system log about entries whose changes cannot be told. Only the first entry of
+/// each kind gets a line.
 constexpr const char* unknowable = "; such entries count as changed whenever they are asked about";
 
 /// True when the path leads nowhere, as opposed to where one cannot look.

@@ -9,6 +9,7 @@
 
 #include "platform/event_journal.h"
 #include "platform/file_system.h"
+#include "platform/linux/journal/entry_look.h"
 #include "platform/linux/journal/journal_forest.h"
 
 namespace kel::platform {

@@ -31,20 +31,6 @@ std::vector<std::string> pathsOf(const std::vector<WatchedRoot>& roots) {
 
 }  // namespace
 
-bool JournalSubscription::deliver(const std::shared_ptr<JournalSubscription>& subscription,
-                                  std::vector<JournalEvent> events, EventID position) {
-  subscription->position_ = position;
-  // Handed over while the subscription cannot be closed: its queue is still there.
-  return subscription->queue_.with([&](SerialQueue* queue) {
-    if (!queue) return false;
-    if (events.empty()) return true;
-    queue->async([subscription, events = std::move(events)] {
-      if (subscription->hasQueue()) subscription->callback_(events);
-    });
-    return true;
-  });
-}
-
 JournalService::JournalService(std::vector<WatchedRoot> roots, const JournalOptions& options,
                                FileSystem& files, SystemLog& log, ConcurrentQueue& pool)
     : options_(options),
@@ -54,13 +40,17 @@ JournalService::JournalService(std::vector<WatchedRoot> roots, const JournalOpti
       keeper_(roots, options, files, log, pool),
       mounts_(pathsOf(roots)),
       queue_("kel Journal") {
-  queue_.async([this] { open(); });
+  queue_.async([this] {
+    queue_.assertCurrent();
+    open();
+  });
 }
 
 JournalService::~JournalService() {
   writing_.wait();
   isClosing_ = true;
   queue_.sync([this] {
+    queue_.assertCurrent();
     eventWatch_.reset();
     mountWatch_.reset();
     if (keeper_.keepsIndex() && keeper_.needsSaving()) save();
@@ -69,14 +59,19 @@ JournalService::~JournalService() {
 }
 
 void JournalService::setChangeHandler(ChangeHandler changed) {
-  if (!changed) return queue_.sync([this] { changed_ = nullptr; });
-  // Not waited for: the queue may be reading the index.
-  queue_.async([this, changed = std::move(changed)]() mutable { changed_ = std::move(changed); });
+  const bool isEnd = !changed;
+  const auto set = [this, changed = std::move(changed)] {
+    queue_.assertCurrent();
+    changed_ = changed;
+  };
+  // Only an end is waited for: the queue may be reading the index.
+  isEnd ? queue_.sync(set) : queue_.async(set);
 }
 
 EventID JournalService::currentEventID() {
   EventID id = 0;
   queue_.sync([&] {
+    queue_.assertCurrent();
     noteMounts();
     id = keeper_.currentEventID();
     finishRound();
@@ -87,6 +82,7 @@ EventID JournalService::currentEventID() {
 bool JournalService::changedSince(const std::vector<std::string>& paths, EventID since) {
   bool changed = true;
   queue_.sync([&] {
+    queue_.assertCurrent();
     noteMounts();
     changed = !keeper_.eventsSince(since, paths, true).empty();
     finishRound();
@@ -96,14 +92,15 @@ bool JournalService::changedSince(const std::vector<std::string>& paths, EventID
 
 void JournalService::subscribe(std::shared_ptr<JournalSubscription> subscription) {
   queue_.async([this, subscription = std::move(subscription)] {
-    std::erase_if(subscriptions_, [](const auto& entry) { return entry.expired(); });
+    queue_.assertCurrent();
+    dropClosedReaders();
     noteMounts();
     std::vector<JournalEvent> events =
-        keeper_.eventsSince(subscription->position(), subscription->paths(), subscription->watchesRoot());
-    events.push_back({{}, event_flags::historyDone, keeper_.lastID()});
-    if (JournalSubscription::deliver(subscription, std::move(events), keeper_.lastID())) {
-      subscriptions_.push_back(subscription);
-    }
+        keeper_.eventsSince(subscription->since(), subscription->paths(), subscription->watchesRoot());
+    const EventID position = keeper_.lastID();
+    events.push_back({{}, event_flags::historyDone, position});
+    JournalSubscription::deliver(subscription, std::move(events));
+    readers_.push_back({subscription, position});
     finishRound();
   });
 }
@@ -111,12 +108,15 @@ void JournalService::subscribe(std::shared_ptr<JournalSubscription> subscription
 void JournalService::open() {
   keeper_.open();
   EventLoop& loop = eventLoop(queue_);
-  loop.assertCurrent();
   if (const int events = keeper_.forest().eventDescriptor(); events >= 0) {
-    eventWatch_ = loop.watch(events, EPOLLIN, [this](std::uint32_t) { readEvents(); });
+    eventWatch_ = loop.watch(events, EPOLLIN, [this](std::uint32_t) {
+      queue_.assertCurrent();
+      readEvents();
+    });
     if (!eventWatch_) log_.write("Cannot wait for changes of watched directories");
     if (mounts_.descriptor() >= 0) {
       mountWatch_ = loop.watch(mounts_.descriptor(), EPOLLPRI, [this](std::uint32_t) {
+        queue_.assertCurrent();
         doubtMounts();
         finishRound();
       });
@@ -124,13 +124,16 @@ void JournalService::open() {
   }
   // Whoever started the server waits for a first answer, which needs the processors more.
   isLooking_ = true;
-  queue_.after(beforeFirstLook, [this] { look(); });
+  lookAfter(beforeFirstLook);
 }
 
 /// In portions, so that questions are answered in between.
 void JournalService::lookFurther() {
   if (!isClosing_ && keeper_.lookInBackground()) {
-    queue_.async([this] { lookFurther(); });
+    queue_.async([this] {
+      queue_.assertCurrent();
+      lookFurther();
+    });
   } else {
     isLooking_ = false;
     lastLook_ = Clock::now() - lookStart_;
@@ -147,16 +150,22 @@ void JournalService::look() {
 void JournalService::scheduleLook() {
   if (isLooking_ || !keeper_.forest().needsLooks() || keeper_.forest().eventDescriptor() < 0) return;
   isLooking_ = true;
-  queue_.after(std::max<Clock::duration>(shortestPause, pausePerLook * lastLook_), [this] { look(); });
+  lookAfter(std::max<Clock::duration>(shortestPause, pausePerLook * lastLook_));
+}
+
+void JournalService::lookAfter(std::chrono::nanoseconds pause) {
+  queue_.after(pause, [this] {
+    queue_.assertCurrent();
+    look();
+  });
 }
 
 void JournalService::readEvents() {
-  eventLoop(queue_).assertCurrent();
   keeper_.forest().readEvents();
   finishRound();
   eventWatch_->setEvents(0);
   queue_.after(betweenGulps, [this] {
-    eventLoop(queue_).assertCurrent();
+    queue_.assertCurrent();
     if (eventWatch_) eventWatch_->setEvents(EPOLLIN);
   });
 }
@@ -178,19 +187,33 @@ void JournalService::finishRound() {
   if (hints.services || hints.applications) {
     deliverLive();
     // The questions may have found more, which no event will announce again.
-    if (!subscriptions_.empty()) queue_.after(betweenGulps, [this] { finishRound(); });
+    if (!readers_.empty()) {
+      queue_.after(betweenGulps, [this] {
+        queue_.assertCurrent();
+        finishRound();
+      });
+    }
   }
   scheduleLook();
   scheduleSaving();
 }
 
 void JournalService::deliverLive() {
-  std::erase_if(subscriptions_, [this](const std::weak_ptr<JournalSubscription>& entry) {
-    const auto subscription = entry.lock();
-    if (!subscription || !subscription->hasQueue()) return true;
+  dropClosedReaders();
+  for (Reader& reader : readers_) {
+    const auto subscription = reader.subscription.lock();
+    if (!subscription) continue;
     std::vector<JournalEvent> events =
-        keeper_.eventsSince(subscription->position(), subscription->paths(), subscription->watchesRoot());
-    return !JournalSubscription::deliver(subscription, std::move(events), keeper_.lastID());
+        keeper_.eventsSince(reader.position, subscription->paths(), subscription->watchesRoot());
+    reader.position = keeper_.lastID();
+    JournalSubscription::deliver(subscription, std::move(events));
+  }
+}
+
+void JournalService::dropClosedReaders() {
+  std::erase_if(readers_, [](const Reader& reader) {
+    const auto subscription = reader.subscription.lock();
+    return !subscription || !subscription->hasQueue();
   });
 }
 
@@ -199,6 +222,7 @@ void JournalService::scheduleSaving() {
   isSavingScheduled_ = true;
   const auto earliest = lastSaving_ + betweenSavings - Clock::now();
   queue_.after(std::max<Clock::duration>(beforeSaving, earliest), [this] {
+    queue_.assertCurrent();
     isSavingScheduled_ = false;
     if (keeper_.needsSaving()) save();
   });
@@ -208,8 +232,8 @@ void JournalService::save() {
   // One at a time, so that the newest is the last. It is not waited for: what it runs on may wait for us.
   if (isWriting_.exchange(true)) return scheduleSaving();
   lastSaving_ = Clock::now();
-  writing_.async(pool_, [this, bytes = keeper_.indexFile()] {
-    if (const auto error = files_.writeAtomically(keeper_.indexPath(), bytes)) {
+  writing_.async(pool_, [this, path = keeper_.indexPath(), bytes = keeper_.indexFile()] {
+    if (const auto error = files_.writeAtomically(path, bytes)) {
       log_.write("Cannot keep the journal's index: " + *error);
     }
     isWriting_ = false;

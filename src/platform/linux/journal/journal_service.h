@@ -4,53 +4,16 @@
 #include <chrono>
 #include <functional>
 #include <memory>
-#include <optional>
-#include <string>
-#include <utility>
 #include <vector>
 
 #include "platform/event_journal.h"
 #include "platform/linux/journal/journal_keeper.h"
+#include "platform/linux/journal/journal_subscription.h"
 #include "platform/linux/journal/mount_table.h"
 #include "platform/linux/queues/event_loop.h"
 #include "platform/work_queue.h"
 
 namespace kel::platform {
-
-/// One reader of the journal. Its callback runs on its own queue, and never after `close`.
-class JournalSubscription {
- public:
-  JournalSubscription(JournalCallback callback, std::vector<std::string> paths, EventID since,
-                      bool watchesRoot)
-      : callback_(std::move(callback)),
-        paths_(std::move(paths)),
-        watchesRoot_(watchesRoot),
-        position_(since) {}
-
-  /// Before the first event.
-  void setQueue(SerialQueue& queue) { queue_.set(&queue); }
-  bool hasQueue() const { return queue_.copy() != nullptr; }
-
-  /// On the subscription's queue, or before the first event.
-  void close() { queue_.set(nullptr); }
-
-  const std::vector<std::string>& paths() const { return paths_; }
-  bool watchesRoot() const { return watchesRoot_; }
-
-  /// The position up to which events were delivered; only on the journal's queue.
-  EventID position() const { return position_; }
-
-  /// On the journal's queue; the events reach up to `position`. False when it was closed.
-  static bool deliver(const std::shared_ptr<JournalSubscription>& subscription,
-                      std::vector<JournalEvent> events, EventID position);
-
- private:
-  const JournalCallback callback_;
-  const std::vector<std::string> paths_;
-  const bool watchesRoot_;
-  EventID position_;
-  Guarded<SerialQueue*> queue_;
-};
 
 /// The journal's thread: it reads the kernel's events, looks at what has to be looked at and answers.
 ///
@@ -77,40 +40,47 @@ class JournalService {
   void subscribe(std::shared_ptr<JournalSubscription> subscription);
 
  private:
-  void open();
-  void look();
-  void lookFurther();
-  void readEvents();
-  void noteMounts();
-  void doubtMounts();
-  void scheduleLook();
-  void finishRound();
-  void deliverLive();
-  void scheduleSaving();
-  void save();
+  /// A subscription and the position up to which its events were delivered.
+  struct Reader {
+    std::weak_ptr<JournalSubscription> subscription;
+    EventID position = 0;
+  };
+
+  void open() KEL_RUNS_ON(queue_);
+  void look() KEL_RUNS_ON(queue_);
+  void lookFurther() KEL_RUNS_ON(queue_);
+  void readEvents() KEL_RUNS_ON(queue_);
+  void noteMounts() KEL_RUNS_ON(queue_);
+  void doubtMounts() KEL_RUNS_ON(queue_);
+  void scheduleLook() KEL_RUNS_ON(queue_);
+  void lookAfter(std::chrono::nanoseconds pause) KEL_RUNS_ON(queue_);
+  void finishRound() KEL_RUNS_ON(queue_);
+  void deliverLive() KEL_RUNS_ON(queue_);
+  void dropClosedReaders() KEL_RUNS_ON(queue_);
+  void scheduleSaving() KEL_RUNS_ON(queue_);
+  void save() KEL_RUNS_ON(queue_);
 
   const JournalOptions options_;
   FileSystem& files_;
   SystemLog& log_;
   ConcurrentQueue& pool_;
 
-  // Only on the queue.
-  JournalKeeper keeper_;
-  MountTable mounts_;
-  ChangeHandler changed_;
-  std::vector<std::weak_ptr<JournalSubscription>> subscriptions_;
-  std::unique_ptr<EventLoop::Watch> eventWatch_;
-  std::unique_ptr<EventLoop::Watch> mountWatch_;
-  std::chrono::steady_clock::time_point lookStart_;
-  std::chrono::steady_clock::time_point lastSaving_;
-  std::chrono::steady_clock::duration lastLook_{};
-  bool isLooking_ = false;  // or about to
-  bool isSavingScheduled_ = false;
+  JournalKeeper keeper_ KEL_ON(queue_);
+  MountTable mounts_ KEL_ON(queue_);
+  ChangeHandler changed_ KEL_ON(queue_);
+  std::vector<Reader> readers_ KEL_ON(queue_);
+  std::unique_ptr<EventLoop::Watch> eventWatch_ KEL_ON(queue_);
+  std::unique_ptr<EventLoop::Watch> mountWatch_ KEL_ON(queue_);
+  std::chrono::steady_clock::time_point lookStart_ KEL_ON(queue_);
+  std::chrono::steady_clock::time_point lastSaving_ KEL_ON(queue_);
+  std::chrono::steady_clock::duration lastLook_ KEL_ON(queue_){};
+  bool isLooking_ KEL_ON(queue_) = false;  // or about to
+  bool isSavingScheduled_ KEL_ON(queue_) = false;
 
   std::atomic<bool> isClosing_ = false;
   std::atomic<bool> isWriting_ = false;
   Group writing_;
-  SerialQueue queue_;
+  SerialQueue queue_;  // the last, so that it ends before what its tasks touch
 };
 
 }  // namespace kel::platform

@@ -108,7 +108,7 @@ class JournalTree {
   std::size_t vanishedCount = 0;
   bool isTooLarge = false;      ///< more entries than are worth remembering
   bool approachChanged = true;  ///< the directories on the way to the root may be others
-  dev_t device = 0;             ///< where the root was last found, to notice another one in its place
+  std::uint64_t device = 0;     ///< where the root was last found, to notice another one in its place
   std::uint64_t inode = 0;
 
  private:

@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "platform/linux/journal/journal_service.h"
+#include "platform/linux/journal/journal_subscription.h"
 
 namespace kel::platform {
 

@@ -9,6 +9,7 @@
 
 #include "platform/linux/files/files.h"
 #include "platform/linux/queues/serial_queue.h"
+#include "platform/linux/queues/while_alive.h"
 
 namespace kel::platform {
 
@@ -21,20 +22,24 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
           SystemLog& log)
       : store_(store.directory()),
         name_(std::move(name)),
-        queue_(queue),
+        keptLoop_(eventLoop(queue).shared_from_this()),
+        loop_(*keptLoop_),
         posted_(std::move(posted)),
         log_(log) {}
 
   std::optional<std::string> start() {
     inotify_ = OwnedDescriptor(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
     if (!inotify_ || !watchDirectory()) return errorLine(store_.directory(), errno);
-    if (const auto record = store_.read(name_)) lastSeen_ = record->posts;
-    queue_.async([self = shared_from_this()] { self->listen(); });
+    const auto record = store_.read(name_);
+    loop_.async([self = shared_from_this(), seen = record ? record->posts : 0] {
+      self->loop_.assertCurrent();
+      self->listen(seen);
+    });
     return std::nullopt;
   }
 
   void stop() {
-    eventLoop(queue_).assertCurrent();
+    loop_.assertCurrent();
     stopped_ = true;
     watch_.reset();
   }
@@ -47,15 +52,14 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
            inotify_add_watch(inotify_.get(), store_.directory().c_str(), events) >= 0;
   }
 
-  void listen() {
+  void listen(std::uint64_t seen) KEL_RUNS_ON(loop_) {
     if (stopped_) return;
-    watch_ = eventLoop(queue_).watch(inotify_.get(), EPOLLIN, [self = weak_from_this()](std::uint32_t) {
-      if (const auto watcher = self.lock()) watcher->look();
-    });
+    lastSeen_ = seen;
+    watch_ = loop_.watch(inotify_.get(), EPOLLIN, whileAlive(weak_from_this(), loop_, &Watcher::look));
     if (!watch_) log_.write("Cannot watch notifications: " + errorLine(store_.directory(), errno));
   }
 
-  void look() {
+  void look() KEL_RUNS_ON(loop_) {
     // Where the directory itself went away its successor is watched, before the count is read.
     if (drain()) watchDirectory();
     const auto record = store_.read(name_);
@@ -78,17 +82,18 @@ class DirectoryObservation::Watcher : public std::enable_shared_from_this<Watche
     return isGone;
   }
 
+  // Fixed after construction; `inotify_` once `start` has handed over to the loop.
   const NotificationStore store_;
   const std::string name_;
-  SerialQueue& queue_;
+  const std::shared_ptr<EventLoop> keptLoop_;
+  EventLoop& loop_;
   const std::function<void()> posted_;
   SystemLog& log_;
   OwnedDescriptor inotify_;
 
-  // Set by `start`, then only on queue_.
-  std::uint64_t lastSeen_ = 0;
-  bool stopped_ = false;
-  std::unique_ptr<EventLoop::Watch> watch_;
+  std::uint64_t lastSeen_ KEL_ON(loop_) = 0;
+  bool stopped_ KEL_ON(loop_) = false;
+  std::unique_ptr<EventLoop::Watch> watch_ KEL_ON(loop_);
 };
 
 DirectoryObservation::DirectoryObservation(const NotificationStore& store, std::string name,

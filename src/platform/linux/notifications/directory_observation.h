@@ -14,8 +14,8 @@ namespace kel::platform {
 
 /// An observation of one name through its store's directory.
 ///
-/// Made and started on any thread, destroyed on `queue` or after it has ended. Borrows `queue` and
-/// `log`, which outlive it.
+/// Made and started on any thread, destroyed on `queue` or after it has ended. Borrows `log`, which outlives
+/// it.
 class DirectoryObservation final : public NotificationSeeds::Observation {
  public:
   DirectoryObservation(const NotificationStore& store, std::string name, SerialQueue& queue,

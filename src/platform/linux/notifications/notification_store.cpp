@@ -13,6 +13,23 @@
 #include "platform/linux/files/files.h"
 #include "platform/linux/files/sealed_bytes.h"
 
+// A record is changed in four steps: take the lock, read the record, write the changed one as ".new", rename
+// it over the old. Whoever reads takes no lock: it opens the file before or after the rename and has one
+// record or the other, whole.
+//
+// The lock is one file for all names, held by `flock`. The kernel lets go of it when its holder dies, so
+// there is no stale one to judge. It is never removed: who had it open would hold the lock of a file that
+// others no longer find. It is tried again and again rather than waited for, because a holder that was
+// stopped would stop every program of the user. ".new" is written under the lock only, so one name does, and
+// what a crash left there is cut to nothing by the next.
+//
+// Everything is reached below one open directory, checked to be the user's after it was opened: one that is
+// put in its place meanwhile is not written to. Nothing is flushed to the disk, because records end with the
+// session.
+//
+// Never happens: a post that is lost to another one at the same time; a count that comes again, since a name
+// without a record starts from the clock. A record that cannot be read counts as never set, and the next
+// change replaces it.
 namespace kel::platform {
 
 namespace {

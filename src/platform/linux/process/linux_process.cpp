@@ -34,6 +34,7 @@ LinuxProcess::LinuxProcess() {
 }
 
 void LinuxProcess::onTermination(Task handler) {
+  // Blocked on the main thread; the others are started with every signal blocked. So it stays pending for us.
   const sigset_t termination = terminationSignal();
   pthread_sigmask(SIG_BLOCK, &termination, nullptr);
   const int arrivals = signalfd(-1, &termination, SFD_CLOEXEC);
@@ -50,6 +51,7 @@ void LinuxProcess::onTermination(Task handler) {
   }).detach();
 }
 
+// Static objects are not destroyed: other threads go on using them to the end.
 void LinuxProcess::exitNow(int status) {
   if (ftrylockfile(stdout) == 0) {
     fflush_unlocked(stdout);

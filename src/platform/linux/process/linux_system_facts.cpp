@@ -97,6 +97,7 @@ SystemReading LinuxSystemFacts::bootTime() {
   const Digest digest = md5({reinterpret_cast<const std::uint8_t*>(identifier.data()), identifier.size()});
   std::uint64_t number = 0;
   for (std::size_t i = 0; i < sizeof number; ++i) number = number << 8 | digest[i];
+  // One bit less, so that it is never negative.
   return {static_cast<std::int64_t>(number >> 1), 0, {}};
 }
 

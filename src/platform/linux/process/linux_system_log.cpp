@@ -10,6 +10,21 @@
 #include "platform/linux/process/unix_address.h"
 #include "property_lists/unicode.h"
 
+// Where a line goes. One datagram to the daemon's socket, without waiting. A daemon that is there but takes
+// no more has refused: the line is lost, and counted. Where nobody listens it goes to standard error. A
+// daemon that was started again listens on a new socket, while ours is still connected to the dead one and
+// only says so when we send; so the first failure makes a new connection, and the second one means that
+// nobody is there.
+//
+// Threads share the connection by pointer: one that replaces it closes nothing under another that is just
+// sending.
+//
+// Standard error may be a terminal that was stopped, or a pipe that nobody reads, and cannot be made
+// non-blocking, as others write to it through the same description. So it is asked first, and a line is kept
+// short enough for what a pipe takes whole once it says that it is ready.
+//
+// Losses are taken out of the counter by the next line and put back with it when that is lost too: each is
+// told once, by whichever line gets through.
 namespace kel::platform {
 
 namespace {

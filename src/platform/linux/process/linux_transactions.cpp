@@ -23,29 +23,26 @@ LinuxTransactions::LinuxTransactions(const std::optional<std::string>& notificat
 }
 
 LinuxTransactions::~LinuxTransactions() {
-  {
-    const std::lock_guard lock(mutex_);
-    ending_ = true;
-  }
-  changed_.notify_one();
+  work_.change([](Work& work) {
+    work.ending = true;
+    return Wake::One;
+  });
   if (reporter_.joinable()) reporter_.join();
 }
 
 void LinuxTransactions::open() {
-  {
-    const std::lock_guard lock(mutex_);
-    ++count_;
-  }
-  changed_.notify_one();
+  work_.change([](Work& work) {
+    ++work.open;
+    return Wake::One;
+  });
 }
 
 void LinuxTransactions::close() {
-  {
-    const std::lock_guard lock(mutex_);
-    assert(count_ > 0);
-    --count_;
-  }
-  changed_.notify_one();
+  work_.change([](Work& work) {
+    assert(work.open > 0);
+    --work.open;
+    return Wake::One;
+  });
 }
 
 void LinuxTransactions::trackActivity() {
@@ -55,18 +52,19 @@ void LinuxTransactions::trackActivity() {
 void LinuxTransactions::reportChanges() {
   bool toldReady = false;
   std::optional<std::uint64_t> told;
-  std::unique_lock lock(mutex_);
-  while (!ending_) {
-    const std::uint64_t count = count_;
-    lock.unlock();
-    const Report result = report(!toldReady, count);
+  while (const std::optional<std::uint64_t> count = awaitNews(told)) {
+    const Report result = report(!toldReady, *count);
     if (result == Report::Taken) toldReady = true;
     if (result != Report::KeptBack) told = count;
     // What changes meanwhile is one report, and wakes nobody.
     std::this_thread::sleep_for(reportInterval);
-    lock.lock();
-    changed_.wait(lock, [&] { return ending_ || told != count_; });
   }
+}
+
+/// The count, once it is another than was told; absent at the end.
+std::optional<std::uint64_t> LinuxTransactions::awaitNews(std::optional<std::uint64_t> told) {
+  return work_.when([told](const Work& work) { return work.ending || told != work.open; },
+                    [](const Work& work) { return work.ending ? std::nullopt : std::optional(work.open); });
 }
 
 LinuxTransactions::Report LinuxTransactions::report(bool withReadiness, std::uint64_t count) const {

@@ -9,6 +9,20 @@
 
 #include "platform/linux/files/files.h"
 
+// What counts as doubt. A sandboxed process must not have more done for it than it may do itself, so the
+// answer "not sandboxed" needs every sign to be read and to be absent; what cannot be read says "sandboxed".
+//
+// The signs are those that a sandbox cannot take off from inside: a user namespace or a root directory other
+// than ours (both compared by what the link in /proc leads to, not by its text), the information file that a
+// runtime puts into the root, a control group named by a runtime's launcher, a security label other than ours
+// that confines. That a security module is not there is no doubt: the kernel says so with ENOENT or EINVAL.
+// That a file cannot be read for another reason is one, and so is our own label, when there is nothing to
+// compare with.
+//
+// The process may end at any time and its id pass to another. All is read below one open directory of /proc,
+// which stays that of the process it was opened for, but that may have been the other one already. Hence the
+// last question, to the process descriptor of the connection: is the one that connected still there? Then the
+// id was its own all the time. A process without descriptor is in doubt from the start.
 namespace kel::platform {
 
 namespace {

@@ -1,37 +1,54 @@
 #include <algorithm>
 #include <atomic>
-#include <condition_variable>
 #include <deque>
-#include <mutex>
+#include <optional>
 #include <thread>
 #include <utility>
 #include <vector>
 
+#include "platform/linux/queues/monitor.h"
 #include "platform/linux/queues/thread.h"
 #include "platform/work_queue.h"
 
+// How `apply` ends, wherever it is called. A caller that only waited would hold up a pool whose threads all
+// call `apply` from their tasks: each would wait for tasks that no thread is left to run. So the caller draws
+// indices too, and could do all of the work alone; the tasks it queues are an offer to whoever is free. They
+// share one counter, from which everybody draws the next index, so that a slow call holds up nobody else's
+// share.
+//
+// The caller returns when every index is done. It waits for calls that some thread is in the middle of, never
+// for a task in the queue. Those of its tasks that begin later find no index left and go. The state they look
+// at is shared for their sake; the work itself is the caller's, and nobody without an index touches it.
+//
+// Never happens: a wait in a circle, as a call waits only for calls that began after it, further down; a
+// result that the caller does not see, as each participant adds to `done` under the lock that the caller
+// takes to read it.
 namespace kel::platform {
 
 struct ConcurrentQueue::Pool {
+  struct Inbox {
+    std::deque<Task> tasks;
+    bool finishing = false;
+  };
+  using Wake = Monitor<Inbox>::Wake;
+
   void run() {
-    std::unique_lock lock(mutex);
-    for (;;) {
-      arrived.wait(lock, [this] { return finishing || !tasks.empty(); });
-      if (tasks.empty()) return;
-      Task task = std::move(tasks.front());
-      tasks.pop_front();
-      lock.unlock();
-      task();
-      task = nullptr;
-      lock.lock();
-    }
+    while (const std::optional<Task> task = next()) (*task)();
   }
 
-  std::mutex mutex;
-  std::condition_variable arrived;
-  std::deque<Task> tasks;
-  bool finishing = false;
-  std::vector<std::thread> threads;
+  /// Waits for a task; absent when the queue has ended and all are run.
+  std::optional<Task> next() {
+    return inbox.when([](const Inbox& now) { return now.finishing || !now.tasks.empty(); },
+                      [](Inbox& now) -> std::optional<Task> {
+                        if (now.tasks.empty()) return std::nullopt;
+                        std::optional<Task> task = std::move(now.tasks.front());
+                        now.tasks.pop_front();
+                        return task;
+                      });
+  }
+
+  Monitor<Inbox> inbox;
+  std::vector<std::thread> threads;  // fixed between construction and destruction of the queue
 };
 
 ConcurrentQueue::ConcurrentQueue() : pool_(std::make_shared<Pool>()) {
@@ -42,11 +59,10 @@ ConcurrentQueue::ConcurrentQueue() : pool_(std::make_shared<Pool>()) {
 }
 
 ConcurrentQueue::~ConcurrentQueue() {
-  {
-    const std::lock_guard lock(pool_->mutex);
-    pool_->finishing = true;
-  }
-  pool_->arrived.notify_all();
+  pool_->inbox.change([](Pool::Inbox& inbox) {
+    inbox.finishing = true;
+    return Pool::Wake::All;
+  });
   for (std::thread& thread : pool_->threads) {
     if (thread.get_id() == std::this_thread::get_id()) {
       thread.detach();
@@ -57,14 +73,15 @@ ConcurrentQueue::~ConcurrentQueue() {
 }
 
 void ConcurrentQueue::async(Task task) {
-  {
-    const std::lock_guard lock(pool_->mutex);
-    pool_->tasks.push_back(std::move(task));
-  }
-  pool_->arrived.notify_one();
+  pool_->inbox.change([&task](Pool::Inbox& inbox) {
+    inbox.tasks.push_back(std::move(task));
+    return Pool::Wake::One;
+  });
 }
 
 namespace {
+
+using Count = Monitor<std::size_t>;
 
 /// One `apply`: whoever takes part draws the next index until none is left. Shared with the pool's tasks,
 /// some of which may begin only when the call has long returned; they find no index and never touch `work`.
@@ -78,22 +95,20 @@ struct Application {
       ++performed;
     }
     if (performed == 0) return;
-    const std::lock_guard lock(mutex);
-    done += performed;
-    if (done == count) finished.notify_all();
+    done.change([&](std::size_t& number) {
+      number += performed;
+      return number == count ? Count::Wake::All : Count::Wake::Nobody;
+    });
   }
 
   void awaitOthers() {
-    std::unique_lock lock(mutex);
-    finished.wait(lock, [this] { return done == count; });
+    done.await([this](std::size_t number) { return number == count; });
   }
 
   const std::size_t count;
   const std::function<void(std::size_t)>& work;
   std::atomic<std::size_t> next = 0;
-  std::mutex mutex;
-  std::condition_variable finished;
-  std::size_t done = 0;
+  Count done;
 };
 
 }  // namespace
@@ -108,31 +123,28 @@ void ConcurrentQueue::apply(std::size_t count, const std::function<void(std::siz
 }
 
 struct Group::State {
-  std::mutex mutex;
-  std::condition_variable finished;
-  std::size_t underWay = 0;
+  Count underWay;
 };
 
 Group::Group() : state_(std::make_shared<State>()) {}
 Group::~Group() = default;
 
 void Group::async(ConcurrentQueue& queue, Task task) {
-  {
-    const std::lock_guard lock(state_->mutex);
-    ++state_->underWay;
-  }
+  state_->underWay.change([](std::size_t& number) {
+    ++number;
+    return Count::Wake::Nobody;
+  });
   queue.async([state = state_, task = std::move(task)]() mutable {
     task();
     // What the task holds is let go of before it counts as done.
     task = nullptr;
-    const std::lock_guard lock(state->mutex);
-    if (--state->underWay == 0) state->finished.notify_all();
+    state->underWay.change(
+        [](std::size_t& number) { return --number == 0 ? Count::Wake::All : Count::Wake::Nobody; });
   });
 }
 
 void Group::wait() {
-  std::unique_lock lock(state_->mutex);
-  state_->finished.wait(lock, [this] { return state_->underWay == 0; });
+  state_->underWay.await([](std::size_t number) { return number == 0; });
 }
 
 }  // namespace kel::platform

@@ -12,6 +12,25 @@
 
 #include "platform/linux/queues/thread.h"
 
+// Rounds. In each the thread takes everything that was queued so far, with the timers that are due behind it,
+// runs it in order and then serves the descriptors that are ready, without waiting if it ran anything. What a
+// task queues is for the next round: a queue that keeps itself busy still hears its descriptors, and they
+// never starve its tasks either, as one round serves 32 events at most.
+//
+// Wake-ups. `asleep` is set, under the inbox's lock, by the thread that found nothing to do, and taken back
+// by the first who brings something; only that one writes to the event descriptor. When the write comes
+// before the thread has begun to wait it is still there to end the wait at once, so the gap between the two
+// does no harm. A timer that is due later than the earliest wakes nobody.
+//
+// Watches. Each has a number of its own that goes into the kernel's event and is never used again. A callback
+// may destroy any watch, while events for it may already have been fetched in the same call: they are looked
+// up by number and found gone. The descriptor would not do as a key: closed and opened again it names another
+// file. A callback that destroys its own watch goes on to its end, because the loop holds the callback while
+// it runs.
+//
+// The end. When `finish` was called and nothing is queued the thread drops the rest, and tasks that come
+// later are dropped where they come, so that what they hold is let go of at once. From then on the loop's
+// things belong to whoever still holds them: `ended_` is set last, and read first by `assertCurrent`.
 namespace kel::platform {
 
 namespace {
@@ -62,6 +81,7 @@ void EventLoop::finish() {
 
 void EventLoop::run() {
   currentLoop() = this;
+  assertCurrent();
   for (;;) {
     Round round = nextRound();
     if (round.finished) break;

@@ -67,8 +67,8 @@ class KEL_CAPABILITY("loop") EventLoop : public std::enable_shared_from_this<Eve
 
   bool isCurrent() const;
 
-  /// States that the caller runs on the loop's thread, or that this thread has ended: nobody else can be at
-  /// the loop's things. Checked in debug builds.
+  /// States that the caller may touch what belongs to the loop: it runs on the loop's thread, or that thread
+  /// has ended, so that nobody else runs there. Checked in debug builds.
   void assertCurrent() const KEL_ASSERTS_CAPABILITY(this);
 
   /// Calls `callback` with the epoll events of `descriptor`, which stays open while it is watched, as long as
@@ -92,8 +92,8 @@ class KEL_CAPABILITY("loop") EventLoop : public std::enable_shared_from_this<Eve
 
   void run();
   Round nextRound();
-  void serveDescriptors(int waitMilliseconds);
-  void dropEverything();
+  void serveDescriptors(int waitMilliseconds) KEL_RUNS_ON(this);
+  void dropEverything() KEL_RUNS_ON(this);
   void wake();
   bool epollControl(int operation, int descriptor, std::uint32_t events, std::uint64_t id);
   void change(std::uint64_t id, int descriptor, std::uint32_t events);
@@ -108,8 +108,8 @@ class KEL_CAPABILITY("loop") EventLoop : public std::enable_shared_from_this<Eve
 
   // Only on the loop's thread. Identities are never reused, so that an event that was fetched for a watch
   // which is gone meanwhile finds nothing.
-  std::unordered_map<std::uint64_t, std::shared_ptr<const Callback>> callbacks_;
-  std::uint64_t lastWatch_ = 0;
+  std::unordered_map<std::uint64_t, std::shared_ptr<const Callback>> callbacks_ KEL_ON(this);
+  std::uint64_t lastWatch_ KEL_ON(this) = 0;
 };
 
 }  // namespace kel::platform

@@ -36,6 +36,7 @@ std::optional<RememberedApplications> decodeApplications(BytesView file) {
     std::string path(reader->string());
     const EntryStatus information = readStatus(*reader);
     const std::uint64_t flags = reader->number();
+    // As they were written: so they are also different, and the map need not search for their places.
     const bool isInOrder = applications.empty() || applications.rbegin()->first < path;
     if (!isInOrder || flags > std::numeric_limits<std::uint32_t>::max()) reader->fail();
     applications.emplace_hint(applications.end(), std::move(path),

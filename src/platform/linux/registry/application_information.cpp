@@ -6,6 +6,7 @@
 
 #include "platform/application_registry.h"
 #include "platform/file_system.h"
+#include "platform/linux/journal/entry_look.h"
 
 namespace kel::platform {
 
@@ -14,6 +15,7 @@ InformationStatus informationStatus(const std::string& application) {
   InformationStatus result{record.isLink() ? record.target : record.status, true, record.isLink()};
   if (result.exists()) return result;
   const std::uint64_t error = std::exchange(result.status, {}).size;
+  // Other errors say that there may be one which cannot be seen now: permissions, a disk, a server far away.
   result.isKnown = error == ENOENT || error == ENOTDIR || error == ELOOP;
   return result;
 }

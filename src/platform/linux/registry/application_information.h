@@ -8,10 +8,10 @@
 
 namespace kel::platform {
 
-/// What can be told about an application's information dictionary without opening it. Links are followed.
+/// The status (see `EntryStatus`) of an application's information dictionary, links followed.
 struct InformationStatus {
-  EntryStatus status;    ///< without anything when there is no such file, or when it cannot be told
-  bool isKnown = false;  ///< it can be told
+  EntryStatus status;  ///< of kind unknown, and else empty, when there is no such file or `isKnown` is false
+  bool isKnown = false;  ///< the kernel answered, be it that there is no such file
   bool isLink = false;   ///< the dictionary lies somewhere else
 
   bool exists() const { return status.kind != EntryKind::Unknown; }

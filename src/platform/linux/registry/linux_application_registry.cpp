@@ -4,8 +4,27 @@
 #include <utility>
 
 #include "platform/linux/files/files.h"
+#include "platform/linux/journal/entry_look.h"
 #include "platform/linux/registry/application_information.h"
 
+// What is remembered, from the cheapest answer to the dearest. The last scan is the answer itself, as long as
+// the change log tells of nothing below the roots since the position that was taken before that scan.
+// Outsiders are compared each time: applications and information dictionaries behind links, which change
+// where no root is. Else the folders are listed, and each application looked at. The memory holds what its
+// dictionary said and the status that it had then; with the same status now it is not read. The database is
+// the memory on disk, for the next process.
+//
+// A look is settled when every later change of the dictionary must show in its status: the status could be
+// had, the last change is longer ago than the file system's clock is coarse, and nothing changed while it was
+// read. Only settled looks are remembered. One that is not, like a folder that could not be listed, leaves
+// the answer good for this once: the scan keeps no position, so that the next query scans again.
+//
+// One scan runs at a time; who asks meanwhile waits and mostly finds it good enough. The database is written
+// in the background, one write at a time and of the newest memory only.
+//
+// Never happens: an answer that is older than a change that came before the question (the position is from
+// before the scan, so what changes during it counts as later); a dictionary that is taken for unchanged
+// because two changes fell into one tick of the clock.
 namespace kel::platform {
 
 LinuxApplicationRegistry::LinuxApplicationRegistry(FileSystem& files, SystemLog& log, ConcurrentQueue& queue,
@@ -44,7 +63,7 @@ void LinuxApplicationRegistry::seed(std::function<void()> done) {
 }
 
 LinuxApplicationRegistry::Applications LinuxApplicationRegistry::current() {
-  const std::lock_guard lock(scanning_);
+  const MutexLock lock(scanning_);
   if (!lastScanHolds()) last_ = scan();
   return last_.applications;
 }
@@ -61,7 +80,9 @@ LinuxApplicationRegistry::Scan LinuxApplicationRegistry::scan() {
   ApplicationWalk walk = walkRoots();
   const std::size_t count = walk.applications.size();
   std::vector<Look> looks(count);
-  queue_.apply(count, [&](std::size_t index) { looks[index] = lookAt(walk.applications[index].path); });
+  queue_.apply(count, [&, memory = memory_](std::size_t index) {
+    looks[index] = lookAt(walk.applications[index].path, *memory);
+  });
 
   Scan result;
   RememberedApplications settled;
@@ -100,10 +121,11 @@ LinuxApplicationRegistry::Outsider LinuxApplicationRegistry::Outsider::at(const 
   return {path, platform::isDirectory(path), informationStatus(path).status};
 }
 
-LinuxApplicationRegistry::Look LinuxApplicationRegistry::lookAt(const std::string& application) const {
+LinuxApplicationRegistry::Look LinuxApplicationRegistry::lookAt(const std::string& application,
+                                                                const RememberedApplications& memory) const {
   const InformationStatus before = informationStatus(application);
-  const auto known = memory_->find(application);
-  if (before.isKnown && known != memory_->end() && known->second.information == before.status)
+  const auto known = memory.find(application);
+  if (before.isKnown && known != memory.end() && known->second.information == before.status)
     return {known->second, true, before.isLink};
 
   Look look{{before.status, 0}, before.isKnown, before.isLink};
@@ -121,8 +143,8 @@ void LinuxApplicationRegistry::remember(RememberedApplications settled) {
   memory_ = std::make_shared<const RememberedApplications>(std::move(settled));
   databaseIsUnusable_ = false;
   if (!database_) return;
-  const bool isWriting = unwritten_.with([this](Unwritten& unwritten) {
-    unwritten.memory = memory_;
+  const bool isWriting = unwritten_.with([memory = memory_](Unwritten& unwritten) {
+    unwritten.memory = memory;
     return std::exchange(unwritten.isWriting, true);
   });
   if (!isWriting) background_.async(queue_, [this] { writeDatabase(); });

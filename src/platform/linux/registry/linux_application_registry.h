@@ -2,7 +2,6 @@
 
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -11,6 +10,7 @@
 #include "platform/file_system.h"
 #include "platform/guarded.h"
 #include "platform/linux/journal/change_log.h"
+#include "platform/linux/queues/mutex.h"
 #include "platform/linux/registry/application_database.h"
 #include "platform/linux/registry/application_walk.h"
 #include "platform/system_log.h"
@@ -85,12 +85,12 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
   };
 
   Applications current();
-  bool lastScanHolds() const;
-  Scan scan();
+  bool lastScanHolds() const KEL_RUNS_ON(scanning_);
+  Scan scan() KEL_RUNS_ON(scanning_);
   ApplicationWalk walkRoots();
-  Look lookAt(const std::string& application) const;
-  void remember(RememberedApplications settled);
-  void loadDatabase();
+  Look lookAt(const std::string& application, const RememberedApplications& memory) const;
+  void remember(RememberedApplications settled) KEL_RUNS_ON(scanning_);
+  void loadDatabase() KEL_RUNS_ON(scanning_);
   void writeDatabase();
 
   FileSystem& files_;
@@ -100,10 +100,10 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
   const std::optional<std::string> database_;
   ChangeLog* const changes_;
 
-  std::mutex scanning_;  // protects the next three
-  Scan last_;
-  Memory memory_;
-  bool databaseIsUnusable_ = false;
+  Mutex scanning_;  // held over a whole scan
+  Scan last_ KEL_ON(scanning_);
+  Memory memory_ KEL_ON(scanning_);  // null before the database was read
+  bool databaseIsUnusable_ KEL_ON(scanning_) = false;
 
   Guarded<Unwritten> unwritten_;
   Group background_;

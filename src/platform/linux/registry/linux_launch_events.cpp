@@ -16,10 +16,12 @@ class DatabaseChangePoster : public std::enable_shared_from_this<DatabaseChangeP
   DatabaseChangePoster(NotificationSeeds& seeds, SerialQueue& queue) : seeds_(seeds), queue_(queue) {}
 
   void note() {
+    queue_.assertCurrent();
     constexpr std::chrono::seconds pause{1};
     if (std::exchange(isPending_, true)) return;
     const auto due = last_ + pause - std::chrono::steady_clock::now();
     queue_.after(due, [self = shared_from_this()] {
+      self->queue_.assertCurrent();
       self->isPending_ = false;
       self->last_ = std::chrono::steady_clock::now();
       self->seeds_.post(databaseChange);
@@ -29,8 +31,8 @@ class DatabaseChangePoster : public std::enable_shared_from_this<DatabaseChangeP
  private:
   NotificationSeeds& seeds_;
   SerialQueue& queue_;
-  bool isPending_ = false;
-  std::chrono::steady_clock::time_point last_;
+  bool isPending_ KEL_ON(queue_) = false;
+  std::chrono::steady_clock::time_point last_ KEL_ON(queue_);
 };
 
 }  // namespace

@@ -1,12 +1,14 @@
 #include "platform/linux/process/linux_process.h"
 
+#include <cerrno>
 #include <sys/resource.h>
 
+#include "platform/linux/process/linux_system_facts.h"
 #include "platform/linux/process/linux_system_log.h"
 #include "platform/linux/process/linux_transactions.h"
 #include "platform/linux/process/process_confinement.h"
-#include "platform/option_parser.h"
 #include "platform/linux/scratch.h"
+#include "platform/option_parser.h"
 #include "property_lists/unicode.h"
 
 namespace kel::platform {
@@ -32,12 +34,52 @@ TEST(ProcessConfinement, ScopesOfSandboxedRuntimesAndConfiningLabelsAreToldAndDo
   EXPECT_TRUE(namesSandboxScope("0::/user.slice/app.slice/app-flatpak-org.example.App-12.scope\n"));
   EXPECT_TRUE(namesSandboxScope("1:name=systemd:/a/snap.editor.editor-1.scope/inner\n0::/\n"));
   EXPECT_FALSE(namesSandboxScope("8:pids:/\n0::/app.slice/flatpak-portal.service\n"));
+  EXPECT_FALSE(namesSandboxScope("0::/app.slice/app-flatpak-org.example.App.scope-1/snap.editor\n"));
   EXPECT_TRUE(isConfiningLabel("snap.editor.editor (enforce)", "unconfined"));
   EXPECT_TRUE(isConfiningLabel("system_u:system_r:container_t:s0:c1,c2", ""));
   EXPECT_FALSE(isConfiningLabel("container (enforce)", "container (enforce)"));
   for (const char* label : {"", "browser (unconfined)", "unconfined_u:unconfined_r:unconfined_t:s0"}) {
     EXPECT_FALSE(isConfiningLabel(label, "server (enforce)")) << label;
   }
+}
+
+using LinuxSystemFactsTest = ScratchTest;
+
+TEST_F(LinuxSystemFactsTest, TheVersionIsMadeOfWhatTheReleaseFileAssigns) {
+  const std::pair<std::string, std::string> rows[] = {
+      {"ID=debian\nVERSION_ID=\"12\"", "debian 12"},
+      {"# ID=x\n\n NAME\n\tID='a\\b' \r\nVERSION_ID=\"1\\\"2\\\\\"\n", "a\\b 1\"2\\"},
+      {"VERSION_ID=\"\nID=''\n", "\""},
+      {"ID=a\nID=b\nIMAGE_VERSION=3\nBUILD_ID=7", "b 7"},
+      {"ID=b\nIMAGE_VERSION=3", "b 3"},
+      {"ID=\xff\nVERSION_ID=2", "2"},
+      {"ID=", "<unknown version>"},
+  };
+  const auto version = [this] { return LinuxSystemFacts(scratch.path()).buildVersion(); };
+  EXPECT_THAT(version(), StartsWith("<unknown version> (kel "));
+  scratch.write("usr/lib/os-release", "ID=vendor");
+  EXPECT_THAT(version(), StartsWith("vendor (kel "));
+  for (const auto& [text, expected] : rows) {
+    scratch.write("etc/os-release", text);
+    EXPECT_THAT(version(), StartsWith(expected + " (kel ")) << text;
+  }
+}
+
+TEST_F(LinuxSystemFactsTest, NumbersAreReadWholeOrNotAtAll) {
+  LinuxSystemFacts facts(scratch.path());
+  EXPECT_EQ(facts.auditSession().errorNumber, ENOENT);
+  for (const char* text : {"", "12x", "-1", "4294967296"}) {
+    scratch.write("proc/self/sessionid", text);
+    EXPECT_EQ(facts.auditSession().errorNumber, EINVAL) << text;
+  }
+  scratch.write("proc/self/sessionid", "4294967295\n");
+  EXPECT_EQ(facts.auditSession().value, -1);
+  scratch.write("proc/sys/kernel/random/boot_id", "\n");
+  EXPECT_EQ(facts.bootTime().errorNumber, ENODATA);
+  scratch.write("proc/sys/kernel/random/boot_id", "1b4e28ba\n");
+  const auto boot = facts.bootTime().value;
+  scratch.write("proc/sys/kernel/random/boot_id", "1b4e28bb\n");
+  EXPECT_NE(facts.bootTime().value, boot);
 }
 
 TEST(OptionParser, BadOptionsAreReportedOnTheErrorStream) {
