@@ -2,7 +2,7 @@
 SHELL := /bin/bash
 .SHELLFLAGS := -euo pipefail -c
 .DEFAULT_GOAL := build
-.PHONY: build demo test package bench fuzz format check-format clean
+.PHONY: build demo test package bench fuzz format check-format check-rooms clean
 
 NEED := scripts/install-dependencies
 SOURCES = find . -path './build*' -prune -o \( -name '*.h' -o -name '*.cpp' \) -print
@@ -50,6 +50,10 @@ format:
 check-format:
 	@$(NEED) ci
 	@$(SOURCES) | xargs clang-format --dry-run --Werror
+
+check-rooms:
+	@$(NEED) build test ci
+	@scripts/check-rooms
 
 clean:
 	@rm -rf build build-*
