@@ -2,14 +2,16 @@
 SHELL := /bin/bash
 .SHELLFLAGS := -euo pipefail -c
 .DEFAULT_GOAL := build
-.PHONY: build demo test package bench fuzz format check-format clean
+# Targets share the folder build/: one after the other, however many jobs make is given.
+.NOTPARALLEL:
+.PHONY: build demo test package bench fuzz format check-format check-rooms clean
 
 NEED := scripts/install-dependencies
 SOURCES = find . -path './build*' -prune -o \( -name '*.h' -o -name '*.cpp' \) -print
 
 build:
 	@$(NEED) build
-	@[ -f build/build.ninja ] || cmake -S . -B build -G Ninja -DKEL_TESTS=OFF
+	@if [ -f build/CMakeCache.txt ]; then scripts/configure build; else scripts/configure build -DKEL_TESTS=OFF; fi
 	@cmake --build build --target kel
 
 demo: build
@@ -17,7 +19,7 @@ demo: build
 
 test:
 	@$(NEED) build test
-	@cmake -S . -B build -G Ninja -DKEL_TESTS=ON
+	@scripts/configure build -DKEL_TESTS=ON
 	@cmake --build build
 	@ctest --test-dir build --output-on-failure --no-tests=error -j "$$(nproc)"
 
@@ -30,7 +32,7 @@ package: build
 BENCH_BUNDLES ?= 10000
 bench:
 	@$(NEED) build bench
-	@cmake -S . -B build-bench -G Ninja -DCMAKE_BUILD_TYPE=Release -DKEL_TESTS=OFF -DKEL_BENCH=ON
+	@scripts/configure build-bench -DCMAKE_BUILD_TYPE=Release -DKEL_TESTS=OFF -DKEL_BENCH=ON
 	@cmake --build build-bench
 	@scripts/bench build-bench $(BENCH_BUNDLES) $(BENCH_ARGS)
 
@@ -38,7 +40,7 @@ bench:
 FUZZ_SECONDS ?= 10
 fuzz:
 	@$(NEED) build ci
-	@cmake -S . -B build-fuzz -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DKEL_TESTS=OFF -DKEL_FUZZ=ON \
+	@scripts/configure build-fuzz -DCMAKE_CXX_COMPILER=clang++ -DKEL_TESTS=OFF -DKEL_FUZZ=ON \
 	  -DKEL_SANITIZE=address,undefined
 	@cmake --build build-fuzz
 	@scripts/fuzz build-fuzz $(FUZZ_SECONDS)
@@ -50,6 +52,10 @@ format:
 check-format:
 	@$(NEED) ci
 	@$(SOURCES) | xargs clang-format --dry-run --Werror
+
+check-rooms:
+	@$(NEED) build test ci
+	@scripts/check-rooms
 
 clean:
 	@rm -rf build build-*

@@ -390,33 +390,5 @@ TEST_F(ConduitTest, OfTheLaunchersSocketsTheOneThatListensAndBearsTheNameIsUsed)
   for (int each = first; each < first + 3; ++each) close(each);
 }
 
-TEST(LauncherSocketsTest, OnlyWhatIsMeantForThisProcessIsTakenAndTheVariablesAreRemoved) {
-  const std::string self = std::to_string(getpid());
-  for (const std::string& row : {self + " 2", std::string("1 2"), self + " ", self + " -1", self + " 2x",
-                                 self + " 100000", self + " 99999999999", std::string(" 2")}) {
-    setenv("LISTEN_PID", row.substr(0, row.find(' ')).c_str(), 1);
-    setenv("LISTEN_FDS", row.substr(row.find(' ') + 1).c_str(), 1);
-    EXPECT_EQ(takeLauncherSockets().count, row == self + " 2" ? 2 : 0) << row;
-    EXPECT_FALSE(getenv("LISTEN_PID") || getenv("LISTEN_FDS"));
-  }
-}
-
-TEST_F(ScratchTest, APrivateDirectoryIsOneThatNobodyElseCanWriteTo) {
-  const std::string path = scratch / "kel";
-  const mode_t before = umask(0777);
-  EXPECT_EQ(makePrivateDirectory(path).error, "");
-  umask(before);
-  EXPECT_EQ(scratch.mode("kel"), 0700U);
-  ASSERT_EQ(symlink(path.c_str(), (scratch / "link").c_str()), 0);
-  for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"}) {
-    EXPECT_EQ(makePrivateDirectory(wrong).path, std::nullopt) << wrong;
-  }
-  chmod(path.c_str(), 0720);
-  EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("kel: others may write to it"));
-  if (geteuid() == 0 && chown(path.c_str(), 12345, 12345) == 0) {
-    EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("belongs to another user"));
-  }
-}
-
 }  // namespace
 }  // namespace kel::platform

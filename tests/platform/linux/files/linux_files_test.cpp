@@ -4,6 +4,7 @@
 #include <thread>
 
 #include "platform/linux/files/linux_bundles.h"
+#include "platform/linux/files/runtime_directory.h"
 #include "platform/linux/notifications/linux_notification_seeds.h"
 #include "platform/linux/registry/linux_application_registry.h"
 #include "platform/linux/scratch.h"
@@ -14,6 +15,7 @@ namespace {
 using namespace std::string_literals;
 using namespace std::chrono_literals;
 using testing::ElementsAre;
+using testing::EndsWith;
 using testing::IsEmpty;
 using testing::StartsWith;
 
@@ -60,6 +62,23 @@ TEST_F(ScratchTest, FailedAtomicWriteLeavesTheOldContentsAndNoTemporaryFile) {
   }
   EXPECT_EQ(scratch.read("file"), "old");
   EXPECT_EQ(scratch.names(), before);
+}
+
+TEST_F(ScratchTest, APrivateDirectoryIsOneThatNobodyElseCanWriteTo) {
+  const std::string path = scratch / "kel";
+  const mode_t before = umask(0777);
+  EXPECT_EQ(makePrivateDirectory(path).error, "");
+  umask(before);
+  EXPECT_EQ(scratch.mode("kel"), 0700U);
+  ASSERT_EQ(symlink(path.c_str(), (scratch / "link").c_str()), 0);
+  for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"}) {
+    EXPECT_EQ(makePrivateDirectory(wrong).path, std::nullopt) << wrong;
+  }
+  chmod(path.c_str(), 0720);
+  EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("kel: others may write to it"));
+  if (geteuid() == 0 && chown(path.c_str(), 12345, 12345) == 0) {
+    EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("belongs to another user"));
+  }
 }
 
 class LinuxApplicationsTest : public ScratchTest {
