@@ -35,11 +35,13 @@ void KELServer::performCommand(KELCommand command, std::shared_ptr<ConduitMessag
   // Run once, on either queue. The list is read when the reply is made, so that a reply after queued work
   // carries what the work left.
   const bool withData = command != KELCommand::KELCommandFlush;
-  const ReplyAction reply = [this, message = withMessage, debugText = debugText, withData] {
+  const ReplyAction reply = [this, message = withMessage, debugText = debugText,
+                             withData](const platform::SharedBytes& otherwise) {
     if (!message || !message->canReply()) return;
     PropertyListDictionaryBuilder contents;
-    if (const platform::SharedBytes data = withData ? currentData() : nullptr)
-      contents.set(protocol::data, data);
+    platform::SharedBytes data = withData ? currentData() : nullptr;
+    if (!data) data = otherwise;
+    if (data) contents.set(protocol::data, data);
     if (debugText) contents.set(protocol::debugOutput, debugText->text());
     message->reply(contents.build());
   };
@@ -60,7 +62,7 @@ void KELServer::performCommand(KELCommand command, std::shared_ptr<ConduitMessag
       default:
         platform_.log.write("KELServer::performCommand: unknown or invalid Conduit message: " +
                             (message ? platform::describeBriefly(message->contents()) : "(null)") + "\n");
-        reply();
+        reply(nullptr);
     }
   };
   if (shouldDebug) {
@@ -72,14 +74,17 @@ void KELServer::performCommand(KELCommand command, std::shared_ptr<ConduitMessag
 }
 
 void KELServer::performFlush(const ReplyAction& reply) {
+  ++queuedFlushes_;
   sync(false, [this](KELDataStore& dataStore) {
+    datastoreQueue_.assertCurrent();
     dataStore.flushCaches();
-    // A rebuild that was under way may have made its list current after it was cleared below.
-    setCurrentPublicDictionariesAllowingNotification(std::nullopt);
+    lastMadeData_ = nullptr;
+    genCountOfFlush_ = currentGenCount_;
+    --queuedFlushes_;
   });
   knownLoadedLocalizations_.set(std::make_shared<const Localizations>());
   setCurrentPublicDictionariesAllowingNotification(std::nullopt);
-  reply();
+  reply(nullptr);
 }
 
 void KELServer::performGet(KELCommand command, const ConduitMessage* message, const ReplyAction& reply) {
@@ -93,17 +98,18 @@ void KELServer::performGet(KELCommand command, const ConduitMessage* message, co
   }
   if (!currentData()) flags = loadFirstList(flags);
   if (newLocalization || flags != 0) {
-    const std::uint32_t snapshot = currentGenCount_;
+    const std::uint32_t snapshot = requestRebuild(flags);
     sync(false, [this, flags, snapshot, newLocalization, localizations = std::move(localizations),
                  reply = newLocalization ? reply : ReplyAction()](KELDataStore& dataStore) {
+      datastoreQueue_.assertCurrent();
       // A new localization must show in the list whatever was rebuilt meanwhile: the count read now always
       // passes.
       if (newLocalization) dataStore.fetchLocalizations(localizations);
       updateServicesCache(flags, newLocalization ? currentGenCount_.load() : snapshot, dataStore);
-      if (newLocalization) reply();
+      if (newLocalization) reply(lastMadeData_);
     });
   }
-  if (!newLocalization) reply();
+  if (!newLocalization) reply(nullptr);
 }
 
 /// Adds the first of `localizations` to the known ones; true when it was not among them. There are so many
@@ -126,17 +132,26 @@ bool KELServer::noteNewLocalization(const std::vector<std::string>& localization
 /// remembers is from an earlier boot session.
 KELStaleCacheFlags KELServer::loadFirstList(KELStaleCacheFlags flags) {
   sync(true, [this, &flags](KELDataStore& dataStore) {
+    datastoreQueue_.assertCurrent();
     if (!dataStore.cacheIsFromThisBootSession()) flags = KELStaleEverything;
-    setCurrentPublicDictionariesAllowingNotification(dataStore.currentPublicDictionaries());
+    lastMadeData_ = setCurrentPublicDictionariesAllowingNotification(dataStore.currentPublicDictionaries());
   });
   return flags;
 }
 
+/// Leaves `flags` for the next rebuild that begins; returns the generation that a rebuild for them must be
+/// later than. In this order, see `updateServicesCache`.
+std::uint32_t KELServer::requestRebuild(KELStaleCacheFlags flags) {
+  requestedFlags_ |= flags;
+  return currentGenCount_;
+}
+
 void KELServer::performGetAndUpdate(const ReplyAction& reply) {
-  const std::uint32_t snapshot = currentGenCount_;
+  const std::uint32_t snapshot = requestRebuild(KELStaleEverything);
   sync(false, [this, snapshot, reply](KELDataStore& dataStore) {
+    datastoreQueue_.assertCurrent();
     updateServicesCache(KELStaleEverything, snapshot, dataStore);
-    reply();
+    reply(lastMadeData_);
   });
 }
 

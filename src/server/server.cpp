@@ -8,6 +8,20 @@
 
 namespace kel {
 
+// How no change is lost between requests and rebuilds.
+//
+// A request finds on conduitQueue what is stale and queues a rebuild of that on the data-store queue.
+// Rebuilds that queue up behind one another are folded: one stands for all requests that came before it
+// began. It must have begun after them, for what it looked at before may have changed since; so the
+// generation is raised when a rebuild begins. What began before a flush stands for no request that came after
+// it. And it must look at all that they ask for; so a beginning rebuild takes the flags of every request
+// queued so far, those of the works that it makes needless included.
+//
+// A flush clears the list on conduitQueue at once and the data store on its own queue later. What is made
+// there in between was made from what is to be forgotten and does not become current; those who waited for it
+// get it all the same. A list that is current is cleared on conduitQueue only, where requests are answered:
+// none loses its data between the look whether there is any and the reply.
+
 using platform::PropertyListArray;
 using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListValue;
@@ -29,14 +43,11 @@ KELServer::KELServer(platform::Platform& platform)
 KELServer::~KELServer() = default;
 
 void KELServer::incrementServicesSeed() {
-  std::uint64_t seed = 0;
-  while (seed == 0) seed = ++notificationSeed_;
-  // The other queue may raise it meanwhile: whoever stores last stores the newest.
-  for (std::uint64_t stored = 0; stored != seed; seed = notificationSeed_) {
-    stored = seed;
-    platform_.seeds.setState(notificationToken_, stored);
-  }
-  platform_.seeds.post(seedName_);
+  while (++notificationSeed_ == 0) continue;
+  seedQueue_.async([this, transaction = platform::Transaction(platform_.transactions)] {
+    platform_.seeds.setState(notificationToken_, notificationSeed_);
+    platform_.seeds.post(seedName_);
+  });
 }
 
 void KELServer::sync(bool sync, std::function<void(KELDataStore&)> tellDataStore) {
@@ -69,33 +80,35 @@ void KELServer::schmutzItUpForKT(const PropertyListValue& publicDictionaries) {
   });
 }
 
-void KELServer::setCurrentPublicDictionariesAllowingNotification(
+platform::SharedBytes KELServer::setCurrentPublicDictionariesAllowingNotification(
     const std::optional<PropertyListValue>& publicDictionaries) {
   platform::SharedBytes newData;
   if (publicDictionaries) {
     platform::PropertyListWriting written = platform::writeBinaryPropertyList(*publicDictionaries);
     if (!written.bytes) {
       send_debug_line([&] { return "Error generating Services plist: " + written.error; });
-      return;
+      return nullptr;
     }
     newData = std::make_shared<const platform::Bytes>(std::move(*written.bytes));
   }
   {
     // Both queues change the list: publications come in the order of the changes.
     const std::lock_guard lock(changingList_);
+    if (newData && queuedFlushes_ > 0) return newData;
     const platform::SharedBytes oldData = currentData();
-    if (newData == oldData || (newData && oldData && *newData == *oldData)) return;
+    if (newData == oldData || (newData && oldData && *newData == *oldData)) return newData;
     currentData_.set(newData);
     schmutzItUpForKT(publicDictionaries.value_or(PropertyListArray()));
   }
   incrementServicesSeed();
+  return newData;
 }
 
 void KELServer::updateServicesCache(KELStaleCacheFlags flags, std::uint32_t ifGenerationIsCurrent,
                                     KELDataStore& inDataStore) {
   datastoreQueue_.assertCurrent();
   const std::uint32_t current = currentGenCount_;
-  if (current > ifGenerationIsCurrent) {
+  if (current > ifGenerationIsCurrent && current > genCountOfFlush_) {
     send_debug_line([&] {
       return "Coalescing Services update (gen counts were " + std::to_string(ifGenerationIsCurrent) + "/" +
              std::to_string(current);
@@ -103,12 +116,14 @@ void KELServer::updateServicesCache(KELStaleCacheFlags flags, std::uint32_t ifGe
     return;
   }
   send_debug_line([] { return "Updating Services cache"; });
-  inDataStore.updateServicesCache(flags);
+  // In this order: a request that reads the old count has left its flags, one that comes too late for its
+  // flags to be taken reads the new count.
+  ++currentGenCount_;
+  inDataStore.updateServicesCache(flags | requestedFlags_.exchange(0));
   const auto localizations = knownLoadedLocalizations_.copy();
   inDataStore.fetchLocalizations(std::vector<std::string>(localizations->begin(), localizations->end()));
-  setCurrentPublicDictionariesAllowingNotification(inDataStore.currentPublicDictionaries());
+  lastMadeData_ = setCurrentPublicDictionariesAllowingNotification(inDataStore.currentPublicDictionaries());
   inDataStore.writeCaches();
-  ++currentGenCount_;
 }
 
 void KELServer::reactToAppRegistrySeedingComplete() {

@@ -44,20 +44,26 @@ class KELServer {
   /// Every IPC event, launch event and reactor timer runs here.
   platform::SerialQueue& conduitQueue() KEL_RETURNS_CAPABILITY(conduitQueue_) { return conduitQueue_; }
 
-  /// Raises the seed, stores and posts it. Any thread.
+  /// Raises the seed; `seedQueue` stores and posts it. Any thread.
   void incrementServicesSeed();
+
+  /// Seeds reach the platform here, so that none that is older follows a newer one.
+  platform::SerialQueue& seedQueue() { return seedQueue_; }
 
   /// Runs `tellDataStore` on the data-store queue under the caller's debug sink; waits for it when `sync` is
   /// true.
   void sync(bool sync, std::function<void(KELDataStore&)> tellDataStore);
 
   /// Makes `publicDictionaries` (an array, or none) the current list; publishes it and raises the seed if its
-  /// bytes differ from those of the list before. Either queue.
-  void setCurrentPublicDictionariesAllowingNotification(
+  /// bytes differ from those of the list before. A list, on the data-store queue; none, on `conduitQueue`. A
+  /// list made before a flush that has been asked for is not made current. Returns the list's bytes, null for
+  /// none and for one that cannot be written.
+  platform::SharedBytes setCurrentPublicDictionariesAllowingNotification(
       const std::optional<platform::PropertyListValue>& publicDictionaries);
 
-  /// Rebuilds the list unless a rebuild has completed since `ifGenerationIsCurrent` was read. Data-store
-  /// queue.
+  /// Rebuilds the list unless a rebuild has begun since `ifGenerationIsCurrent` was read, and since the last
+  /// flush; looks at what
+  /// `flags` say and at what every request queued so far asks for. Data-store queue.
   void updateServicesCache(KELStaleCacheFlags flags, std::uint32_t ifGenerationIsCurrent,
                            KELDataStore& inDataStore);
 
@@ -79,7 +85,8 @@ class KELServer {
   Localizations knownLoadedLocalizations() const { return *knownLoadedLocalizations_.copy(); }
 
  private:
-  using ReplyAction = std::function<void()>;
+  /// Sends the reply with the current list, else with `otherwise`, which may be null.
+  using ReplyAction = std::function<void(const platform::SharedBytes& otherwise)>;
 
   void schmutzItUpForKT(const platform::PropertyListValue& publicDictionaries);
   void reactToChange(KELEventReactor_t& withReactor, KELStaleCacheFlags dirtyingFlag,
@@ -90,6 +97,7 @@ class KELServer {
   void performGetAndUpdate(const ReplyAction& reply) KEL_RUNS_ON(conduitQueue_);
   bool noteNewLocalization(const std::vector<std::string>& localizations) KEL_RUNS_ON(conduitQueue_);
   KELStaleCacheFlags loadFirstList(KELStaleCacheFlags flags) KEL_RUNS_ON(conduitQueue_);
+  std::uint32_t requestRebuild(KELStaleCacheFlags flags) KEL_RUNS_ON(conduitQueue_);
 
   // Fixed after construction.
   platform::Platform& platform_;
@@ -97,7 +105,11 @@ class KELServer {
   platform::NotificationSeeds::Token notificationToken_ = 0;
 
   const std::unique_ptr<KELDataStore> protectedDatastore_ KEL_TARGET_ON(datastoreQueue_);
-  std::atomic<std::uint32_t> currentGenCount_ = 0;  // raised only on datastoreQueue_
+  std::atomic<std::uint32_t> currentGenCount_ = 0;      // raised only on datastoreQueue_
+  std::atomic<KELStaleCacheFlags> requestedFlags_ = 0;  // of the requests since a rebuild last began
+  std::atomic<std::uint32_t> queuedFlushes_ = 0;        // asked for, but not yet carried out
+  platform::SharedBytes lastMadeData_ KEL_ON(datastoreQueue_);
+  std::uint32_t genCountOfFlush_ KEL_ON(datastoreQueue_) = 0;  // when the last flush was carried out
   std::atomic<std::uint64_t> notificationSeed_ = 0;
   std::mutex changingList_;  // held while the list is compared, set and handed to publication
   platform::Guarded<platform::SharedBytes> currentData_;
@@ -109,6 +121,7 @@ class KELServer {
   KELStaleCacheFlags staleCacheFlags_ KEL_ON(conduitQueue_) = 0;
 
   // Last, so that work still queued at destruction finds everything above: the conduit queue ends first.
+  platform::SerialQueue seedQueue_{"KEL Seed"};
   platform::SerialQueue datastoreQueue_{"KEL Datastore", queue_depths::datastore};
   platform::SerialQueue conduitQueue_{"KEL Conduit Server", queue_depths::conduit};
 };

@@ -37,6 +37,7 @@ class ServerTest : public testing::Test {
       server.conduitQueue().sync([] {});
       server.sync(true, [](KELDataStore&) {});
     }
+    server.seedQueue().sync([] {});
   }
 
   /// Hands a request over as a connection would, without waiting for its answer.
@@ -81,7 +82,10 @@ class ServerTest : public testing::Test {
   }
   void release() { blocked->signal(); }
 
-  std::size_t posts() { return system.seeds.postsOf(seedName); }
+  std::size_t posts() {
+    server.seedQueue().sync([] {});
+    return system.seeds.postsOf(seedName);
+  }
   void setLists(const std::optional<Value>& lists) {
     server.setCurrentPublicDictionariesAllowingNotification(lists);
   }
@@ -218,6 +222,7 @@ TEST(ServerSeedTest, IsKeptDrawnAtRandomAndNeverZero) {
   KELServer server(fresh.platform);
   EXPECT_EQ(seed(fresh), 0U) << "the drawn seed is not stored before the first change";
   server.incrementServicesSeed();
+  server.seedQueue().sync([] {});
   EXPECT_EQ(seed(fresh), 0xabcd00001235U);
 }
 
@@ -308,8 +313,8 @@ TEST_F(RunAsServerTest, SubscribesToItsStreamsInOrder) {
                             "com.orvex.vigil.matching"));
     system.launchEvents.fire.at("com.orvex.broadcastd.matching")();
     ask(get);
-    EXPECT_GE(system.seeds.postsOf(seedName), 2U);
   });
+  EXPECT_GE(system.seeds.postsOf(seedName), 2U);
 }
 
 TEST_F(RunAsServerTest, WhatASandboxedPeerIsRefusedCostsALogLineAndAFailedQuestionMeansNone) {
