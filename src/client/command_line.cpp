@@ -141,12 +141,10 @@ void print_reply(const platform::ConduitReply& reply, PrintedData printedData, s
     output << unknown_message_type("print_reply", "reply", contents) << "\n";
     return;
   }
-  const PropertyListValue* debugOutput = dictionary->find(protocol::debugOutput);
-  if (debugOutput && debugOutput->asString()) output << *debugOutput->asString() << "\n";
-  const PropertyListValue* data = dictionary->find(protocol::data);
-  if (printedData == PrintedData::No || !data || !data->asData()) return;
-  const platform::PropertyListReading list =
-      platform::readPropertyList(**data->asData(), platform::ownLimits);
+  if (const std::string* lines = string_value(*dictionary, protocol::debugOutput)) output << *lines << "\n";
+  const auto* data = typed_value<&PropertyListValue::asData>(*dictionary, protocol::data);
+  if (printedData == PrintedData::No || !data) return;
+  const platform::PropertyListReading list = platform::readPropertyList(**data, platform::ownLimits);
   if (list.value) {
     output << platform::describe(*list.value) << "\n";
   } else {

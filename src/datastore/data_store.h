@@ -111,15 +111,6 @@ class KELDataStore {
 /// The identity of this boot and login session, computed once per process.
 const std::string& boot_session_id(platform::Platform& platform);
 
-/// The value of `key`, or null when it is absent or not of the expected kind; a boolean counts as a number.
-enum class ValueKind { Dictionary, Array, String, Number, Any };
-const platform::PropertyListValue* typed_value(const platform::PropertyListDictionary& dictionary,
-                                               std::string_view key, ValueKind expected);
-const platform::PropertyListDictionary* dictionary_value(const platform::PropertyListDictionary& dictionary,
-                                                         std::string_view key);
-const platform::PropertyListArray* array_value(const platform::PropertyListDictionary& dictionary,
-                                               std::string_view key);
-
 /// The paths of the registered applications that provide services, in the registry's order.
 std::vector<std::string> service_providing_paths(platform::Platform& platform);
 

@@ -22,10 +22,7 @@ constexpr const char* buildVersionKey = "QVServicesBuildVersion";
 
 /// The strings of an array; elements of other kinds are no paths and are passed over.
 std::vector<std::string> stringElements(const PropertyListArray& array) {
-  return map_array(array, [](const PropertyListValue& element) {
-    const std::string* text = element.asString();
-    return text ? std::optional(*text) : std::nullopt;
-  });
+  return map_array(array, [](const PropertyListValue& element) { return element.asString(); });
 }
 
 PropertyListValue arrayOfStrings(const auto& strings) {
@@ -49,36 +46,6 @@ const std::string& boot_session_id(platform::Platform& platform) {
   });
 }
 
-const PropertyListValue* typed_value(const PropertyListDictionary& dictionary, std::string_view key,
-                                     ValueKind expected) {
-  const PropertyListValue* value = dictionary.find(key);
-  if (!value) return nullptr;
-  switch (expected) {
-    case ValueKind::Dictionary:
-      return value->asDictionary() ? value : nullptr;
-    case ValueKind::Array:
-      return value->asArray() ? value : nullptr;
-    case ValueKind::String:
-      return value->asString() ? value : nullptr;
-    case ValueKind::Number:
-      return value->isNumber() ? value : nullptr;
-    case ValueKind::Any:
-      return value;
-  }
-  return nullptr;
-}
-
-const PropertyListDictionary* dictionary_value(const PropertyListDictionary& dictionary,
-                                               std::string_view key) {
-  const PropertyListValue* value = typed_value(dictionary, key, ValueKind::Dictionary);
-  return value ? value->asDictionary() : nullptr;
-}
-
-const PropertyListArray* array_value(const PropertyListDictionary& dictionary, std::string_view key) {
-  const PropertyListValue* value = typed_value(dictionary, key, ValueKind::Array);
-  return value ? value->asArray() : nullptr;
-}
-
 std::unique_ptr<KELDataStore> KELDataStore::initWithSystemServices(platform::Platform& platform) {
   return std::unique_ptr<KELDataStore>(new KELDataStore(platform));
 }
@@ -92,8 +59,8 @@ const std::string& KELDataStore::operatingSystemBuildVersion() const {
 }
 
 bool KELDataStore::validateCacheDictionaryVersion(const PropertyListDictionary& dictionary) const {
-  const PropertyListValue* version = typed_value(dictionary, buildVersionKey, ValueKind::String);
-  return version && *version->asString() == operatingSystemBuildVersion();
+  const std::string* version = string_value(dictionary, buildVersionKey);
+  return version && *version == operatingSystemBuildVersion();
 }
 
 std::optional<PropertyListDictionary> KELDataStore::cacheDictionary() const {
@@ -121,13 +88,12 @@ void KELDataStore::loadCache() {
   const PropertyListDictionary cache = cacheDictionary().value_or(PropertyListDictionary());
   send_debug_line([&] { return "Cache contains " + std::to_string(cache.size()) + " keys"; });
 
-  if (const PropertyListValue* eventID = typed_value(cache, lastEventIDKey, ValueKind::Number)) {
-    eventStreamID_ = eventID->asUnsigned64().value_or(0);
+  if (const auto eventID = typed_value<&PropertyListValue::asUnsigned64>(cache, lastEventIDKey)) {
+    eventStreamID_ = *eventID;
     send_debug_line([&] { return "EventStreamID was " + std::to_string(eventStreamID_); });
   }
 
-  const PropertyListValue* sessionID = typed_value(cache, sessionIDKey, ValueKind::String);
-  cacheSessionID_ = sessionID ? std::optional(*sessionID->asString()) : std::nullopt;
+  cacheSessionID_ = platform::copied(string_value(cache, sessionIDKey));
 
   const PropertyListDictionary* lists = dictionary_value(cache, restrictionListsKey);
   restrictionLists_ = restriction_lists_from_plist(

@@ -40,8 +40,7 @@ void KELDataStore::removeInvalidSpellCheckers(std::vector<PropertyListDictionary
   const std::vector<std::string>& validPaths = validPathsForSpellCheckers();
   std::erase_if(services, [&](const PropertyListDictionaryBuilder& service) {
     if (!service.find(service_keys::QVSpellChecker)) return false;
-    const PropertyListValue* bundlePath = service.find(service_keys::QVBundlePath);
-    const std::string* path = bundlePath ? bundlePath->asString() : nullptr;
+    const std::string* path = string_value(service, service_keys::QVBundlePath);
     return !path || std::none_of(validPaths.begin(), validPaths.end(),
                                  [path](const std::string& valid) { return path->starts_with(valid); });
   });

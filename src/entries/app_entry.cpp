@@ -25,11 +25,6 @@ const PropertyListString versionKey = "vers";
 const PropertyListString servicesKey = "service_dicts";
 const PropertyListString menuStringsKey = "loc_to_menu_strings";
 
-KELAppEntry::Value valueUnder(const PropertyListDictionary& dictionary, std::string_view key) {
-  const PropertyListValue* value = dictionary.find(key);
-  return value ? std::optional(*value) : std::nullopt;
-}
-
 bool isFalseMarker(const PropertyListValue& value) { return value.asBoolean() == false; }
 
 }  // namespace
@@ -50,11 +45,11 @@ std::shared_ptr<KELAppEntry> KELAppEntry::initFromCacheRepresentation(platform::
   const PropertyListDictionary* fields = representation ? representation->asDictionary() : nullptr;
   if (!fields) return nullptr;
   auto entry = initWithBundlePath(platform, std::move(bundlePath));
-  entry->setBundleID(valueUnder(*fields, bundleIDKey.text()));
-  entry->setBundleName(valueUnder(*fields, nameKey.text()));
-  entry->setBundleVersion(valueUnder(*fields, versionKey.text()));
-  entry->setInfoPlistServiceDictionaries(valueUnder(*fields, servicesKey.text()));
-  entry->setLocalizationToMenuStrings(valueUnder(*fields, menuStringsKey.text()));
+  entry->setBundleID(copied(fields->find(bundleIDKey)));
+  entry->setBundleName(copied(fields->find(nameKey)));
+  entry->setBundleVersion(copied(fields->find(versionKey)));
+  entry->setInfoPlistServiceDictionaries(copied(fields->find(servicesKey)));
+  entry->setLocalizationToMenuStrings(copied(fields->find(menuStringsKey)));
   return entry;
 }
 
@@ -96,9 +91,9 @@ bool KELAppEntry::loadFromBundle(platform::Bundle* bundle) {
   if (!bundle) return false;
   Value identifier = bundle->identifier();
   const PropertyListDictionary information = bundle->informationDictionary();
-  Value name = valueUnder(information, "KTBundleName");
-  Value version = valueUnder(information, "KTBundleVersion");
-  Value services = valueUnder(information, "QVServices");
+  Value name = copied(information.find("KTBundleName"));
+  Value version = copied(information.find("KTBundleVersion"));
+  Value services = copied(information.find("QVServices"));
 
   const bool unchanged = identifier == bundleID() && name == bundleName() && version == bundleVersion() &&
                          services == infoPlistServiceDictionaries();

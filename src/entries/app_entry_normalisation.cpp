@@ -214,7 +214,7 @@ void KELAppEntry::applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(
   // A copy: a localization may itself be called "default".
   const PropertyListString defaultTitle = *found->asSharedString();
   for (const auto& [localization, table] : tables.tables) {
-    if (const PropertyListValue* translation = table.asDictionary()->find(defaultTitle.text()))
+    if (const PropertyListValue* translation = table.asDictionary()->find(defaultTitle))
       titles.set(localization, *translation);
   }
 }

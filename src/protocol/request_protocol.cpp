@@ -1,6 +1,7 @@
 #include "protocol/request_protocol.h"
 
 #include <algorithm>
+#include <span>
 #include <sstream>
 #include <utility>
 
@@ -17,14 +18,12 @@ using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListValue;
 
 KELCommand classify_request(const PropertyListDictionary& request) {
-  const PropertyListValue* command = request.find(protocol::command);
-  if (const std::string* name = command ? command->asString() : nullptr) {
+  if (const std::string* name = string_value(request, protocol::command)) {
     if (*name == protocol::flush) return KELCommand::KELCommandFlush;
     if (*name == protocol::getServicesPlist) return KELCommand::KELCommandGetServicesPlist;
     if (*name == protocol::getAndUpdateServicesPlist) return KELCommand::KELCommandGetAndUpdateServicesPlist;
   }
-  const PropertyListValue* localizations = request.find(protocol::localizations);
-  const PropertyListArray* names = localizations ? localizations->asArray() : nullptr;
+  const PropertyListArray* names = array_value(request, protocol::localizations);
   const auto isString = [](const PropertyListValue& value) { return value.asString() != nullptr; };
   return names && std::all_of(names->begin(), names->end(), isString) ? KELCommand::KELCommandLocalizations
                                                                       : KELCommand::KELCommandInvalid;
@@ -35,20 +34,14 @@ bool refused_to_sandboxed(KELCommand command) {
 }
 
 bool wants_debug(const PropertyListDictionary& request) {
-  const PropertyListValue* debug = request.find(protocol::debug);
-  return debug && debug->asBoolean().value_or(false);
+  return typed_value<&PropertyListValue::asBoolean>(request, protocol::debug).value_or(false);
 }
 
 std::vector<std::string> requested_localizations(const PropertyListDictionary& request) {
-  const PropertyListValue* localizations = request.find(protocol::localizations);
-  const PropertyListArray* array = localizations ? localizations->asArray() : nullptr;
-  if (!array) return {};
-  const PropertyListArray first(
-      array->begin(),
-      array->begin() + static_cast<std::ptrdiff_t>(std::min(array->size(), mostRequestedLocalizations)));
-  return map_array(first, [](const PropertyListValue& name) {
-    return name.asString() ? std::optional(*name.asString()) : std::nullopt;
-  });
+  const PropertyListArray* names = array_value(request, protocol::localizations);
+  if (!names) return {};
+  const std::span first(names->begin(), std::min(names->size(), mostRequestedLocalizations));
+  return map_array(first, [](const PropertyListValue& name) { return name.asString(); });
 }
 
 void send_kel_command(platform::Platform& platform, std::string_view command, bool debug,

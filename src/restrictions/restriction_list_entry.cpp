@@ -16,13 +16,6 @@ using platform::PropertyListValue;
 
 const PropertyListString bundleIDKey = "QVBundleID";
 
-std::optional<PropertyListString> stringUnder(const PropertyListDictionary& dictionary,
-                                              const PropertyListString& key) {
-  const PropertyListValue* value = dictionary.find(key.text());
-  const PropertyListString* string = value ? value->asSharedString() : nullptr;
-  return string ? std::optional(*string) : std::nullopt;
-}
-
 }  // namespace
 
 KELRestrictionListEntry::KELRestrictionListEntry(PropertyListString bundleID, PropertyListString title)
@@ -38,7 +31,8 @@ std::optional<KELRestrictionListEntry> KELRestrictionListEntry::initWithDictiona
     const PropertyListValue& representation) {
   const PropertyListDictionary* row = representation.asDictionary();
   if (!row) return std::nullopt;
-  return initWithBundleID(stringUnder(*row, bundleIDKey), stringUnder(*row, service_keys::QVMenuItem));
+  return initWithBundleID(copied(shared_string_value(*row, bundleIDKey)),
+                          copied(shared_string_value(*row, service_keys::QVMenuItem)));
 }
 
 PropertyListDictionary KELRestrictionListEntry::dictionaryRepresentation() const {

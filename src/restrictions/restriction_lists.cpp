@@ -40,15 +40,8 @@ class EntrySet {
 constexpr std::string_view unrestrictedKey = "QVUnrestricted";
 constexpr std::string_view restrictedKey = "QVRestricted";
 
-PropertyListArray arrayUnder(const PropertyListDictionary& dictionary, std::string_view key) {
-  const PropertyListValue* value = dictionary.find(key);
-  const PropertyListArray* array = value ? value->asArray() : nullptr;
-  return array ? *array : PropertyListArray();
-}
-
-std::optional<PropertyListString> sharedString(const PropertyListValue* value) {
-  const PropertyListString* string = value ? value->asSharedString() : nullptr;
-  return string ? std::optional(*string) : std::nullopt;
+PropertyListArray rowsUnder(const PropertyListDictionary& plist, std::string_view key) {
+  return copied(array_value(plist, key)).value_or(PropertyListArray());
 }
 
 }  // namespace
@@ -65,8 +58,8 @@ std::optional<PropertyListDictionary> load_restrictions_file(platform::FileSyste
 std::shared_ptr<const KELRestrictionLists> restriction_lists_from_plist(
     const std::optional<PropertyListDictionary>& plist) {
   if (!plist) return nullptr;
-  const RestrictionListsOf<PropertyListValue> rows{arrayUnder(*plist, unrestrictedKey),
-                                                   arrayUnder(*plist, restrictedKey)};
+  const RestrictionListsOf<PropertyListValue> rows{rowsUnder(*plist, unrestrictedKey),
+                                                   rowsUnder(*plist, restrictedKey)};
   return std::make_shared<const KELRestrictionLists>(
       transform_restriction_lists(rows, &KELRestrictionListEntry::initWithDictionaryRepresentation));
 }
@@ -96,19 +89,17 @@ void apply_restriction_lists(std::vector<PropertyListDictionaryBuilder>& service
 }
 
 bool is_vendor_service(const ServiceView& service) {
-  const PropertyListValue* identifier = service.find(service_keys::QVBundleIdentifier);
-  const std::string* text = identifier ? identifier->asString() : nullptr;
-  return text && text->starts_with("com.orvex.");
+  const std::string* identifier = string_value(service, service_keys::QVBundleIdentifier);
+  return identifier && identifier->starts_with("com.orvex.");
 }
 
 std::optional<KELRestrictionListEntry> restriction_entry_for_service(const ServiceView& service) {
-  const PropertyListValue* menuItem = service.find(service_keys::QVMenuItem);
-  const PropertyListDictionary* titles = menuItem ? menuItem->asDictionary() : nullptr;
+  const PropertyListDictionary* titles = dictionary_value(service, service_keys::QVMenuItem);
   if (!titles) return std::nullopt;
-  std::optional<PropertyListString> title = sharedString(titles->find(service_keys::defaultTitle.text()));
-  if (!title) title = sharedString(titles->find("English"));
+  const PropertyListString* title = shared_string_value(*titles, service_keys::defaultTitle);
+  if (!title) title = shared_string_value(*titles, "English");
   return KELRestrictionListEntry::initWithBundleID(
-      sharedString(service.find(service_keys::QVBundleIdentifier)), std::move(title));
+      copied(shared_string_value(service, service_keys::QVBundleIdentifier)), copied(title));
 }
 
 }  // namespace kel

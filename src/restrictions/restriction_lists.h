@@ -2,6 +2,7 @@
 
 #include <memory>
 #include <optional>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -31,8 +32,8 @@ class ServiceView {
   ServiceView(const platform::PropertyListDictionaryBuilder& service) : building_(&service) {}
 
   /// The value under `key`, or null.
-  const platform::PropertyListValue* find(const platform::PropertyListString& key) const {
-    return finished_ ? finished_->find(key.text()) : building_->find(key);
+  const platform::PropertyListValue* find(std::string_view key) const {
+    return finished_ ? finished_->find(key) : building_->find(key);
   }
 
  private:

@@ -12,6 +12,7 @@ namespace kel {
 
 namespace {
 
+using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListString;
 using platform::PropertyListValue;
@@ -20,9 +21,9 @@ using Entries = std::vector<KELRestrictionListEntry>;
 
 Entries vendorServicesOf(const PropertyListValue& publication) {
   const PropertyListDictionary* dictionary = publication.asDictionary();
-  const PropertyListValue* services = dictionary ? dictionary->find("KTVendedServices") : nullptr;
-  if (!services || !services->asArray()) return {};
-  return map_array(*services->asArray(), [](const PropertyListValue& value) {
+  const PropertyListArray* services = dictionary ? array_value(*dictionary, "KTVendedServices") : nullptr;
+  if (!services) return {};
+  return map_array(*services, [](const PropertyListValue& value) {
     const PropertyListDictionary* service = value.asDictionary();
     return service && is_vendor_service(*service) ? restriction_entry_for_service(*service) : std::nullopt;
   });

@@ -21,9 +21,8 @@ InformationStatus informationStatus(const std::string& application) {
 std::uint32_t informationFlags(BytesView contents) {
   const PropertyListReading reading = readPropertyList(contents, bundleFileLimits);
   const PropertyListDictionary* dictionary = reading.value ? reading.value->asDictionary() : nullptr;
-  const PropertyListValue* services = dictionary ? dictionary->find("QVServices") : nullptr;
-  const PropertyListArray* array = services ? services->asArray() : nullptr;
-  return array && !array->empty() ? ApplicationRegistry::providesServices : 0;
+  const PropertyListArray* services = dictionary ? array_value(*dictionary, "QVServices") : nullptr;
+  return services && !services->empty() ? ApplicationRegistry::providesServices : 0;
 }
 
 std::string informationPath(const std::string& application) { return joinPath(application, "Info.plist"); }
