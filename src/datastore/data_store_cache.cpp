@@ -1,6 +1,7 @@
 #include <utility>
 
 #include "common/common.h"
+#include "datastore/boot_session.h"
 #include "datastore/data_store.h"
 
 namespace kel {
@@ -29,22 +30,7 @@ PropertyListValue arrayOfStrings(const auto& strings) {
   return PropertyListArray(strings.begin(), strings.end());
 }
 
-std::string formatted(const char* call, const platform::SystemReading& reading) {
-  return std::string(call) + " failed with errno " + std::to_string(reading.errorNumber) + " (" +
-         reading.errorText + ")";
-}
-
 }  // namespace
-
-const std::string& boot_session_id(platform::Platform& platform) {
-  return platform.constants.bootSessionID.get([&platform] {
-    const platform::SystemReading boot = platform.facts.bootTime();
-    if (!boot.value) send_debug_line([&] { return formatted("sysctlbyname(\"kern.boottime\")", boot); });
-    const platform::SystemReading session = platform.facts.auditSession();
-    if (!session.value) send_debug_line([&] { return formatted("getaudit_addr()", session); });
-    return std::to_string(boot.value.value_or(0)) + "," + std::to_string(session.value.value_or(0));
-  });
-}
 
 std::unique_ptr<KELDataStore> KELDataStore::initWithSystemServices(platform::Platform& platform) {
   return std::unique_ptr<KELDataStore>(new KELDataStore(platform));
