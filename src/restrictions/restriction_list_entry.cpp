@@ -1,7 +1,5 @@
 #include "restrictions/restriction_list_entry.h"
 
-#include <functional>
-#include <string>
 #include <utility>
 
 #include "common/service_keys.h"
@@ -38,7 +36,5 @@ std::optional<KELRestrictionListEntry> KELRestrictionListEntry::initWithDictiona
 PropertyListDictionary KELRestrictionListEntry::dictionaryRepresentation() const {
   return PropertyListDictionary({{bundleIDKey, bundleID_}, {service_keys::QVMenuItem, title_}});
 }
-
-std::size_t KELRestrictionListEntry::hash() const { return std::hash<std::string>{}(title_.text()); }
 
 }  // namespace kel

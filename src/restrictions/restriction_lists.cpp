@@ -18,8 +18,8 @@ using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListString;
 using platform::PropertyListValue;
 
-/// A set of entries. Hashed by title like the entries themselves; the identifiers under one title are
-/// ordered, so that a list with many rows of one title costs no more than another.
+/// A set of entries, hashed by title. The identifiers under one title are ordered, so that a list with many
+/// rows of one title costs no more than another.
 class EntrySet {
  public:
   explicit EntrySet(const std::vector<KELRestrictionListEntry>& entries) {
