@@ -17,7 +17,6 @@ namespace {
 
 constexpr const char* usageLine =
     "Usage: kel [-debug] [-dump] [-dump_cache] [-update] [-flush] language1 language2...";
-constexpr const char* databaseChangeNotification = "com.orvex.AppRegistry.DatabaseChange";
 
 enum OptionValue : int {
   Help = 1,
@@ -107,7 +106,7 @@ void run(const Invocation& invocation, platform::Platform& platform, std::ostrea
     send_kel_command(platform, protocol::getAndUpdateServicesPlist, debug, printingDebug);
   if (invocation.has(Flush)) send_kel_command(platform, protocol::flush, debug, printingDebug);
   if (invocation.has(MockRegistryChange)) {
-    platform.seeds.post(databaseChangeNotification);
+    platform.seeds.post(platform::databaseChangeNotification);
     output << "Mocking complete\n";
   }
   if (invocation.has(DumpCache)) dumpCache(platform, output);

@@ -14,6 +14,7 @@ namespace {
 // their names come from clients, and there may be any number of them.
 constexpr std::size_t mostRemembered = 256;
 
+namespace information_keys = platform::information_keys;
 using platform::PropertyListDictionary;
 using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListString;
@@ -91,9 +92,9 @@ bool KELAppEntry::loadFromBundle(platform::Bundle* bundle) {
   if (!bundle) return false;
   Value identifier = bundle->identifier();
   const PropertyListDictionary information = bundle->informationDictionary();
-  Value name = copied(information.find("KTBundleName"));
-  Value version = copied(information.find("KTBundleVersion"));
-  Value services = copied(information.find("QVServices"));
+  Value name = copied(information.find(information_keys::name));
+  Value version = copied(information.find(information_keys::version));
+  Value services = copied(information.find(information_keys::services));
 
   const bool unchanged = identifier == bundleID() && name == bundleName() && version == bundleVersion() &&
                          services == infoPlistServiceDictionaries();

@@ -10,6 +10,7 @@ namespace kel {
 
 namespace {
 
+namespace information_keys = platform::information_keys;
 using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListValue;
@@ -158,10 +159,10 @@ bool KELAppEntry::validateBaseServiceKeysIntoErrors(ValidationErrors* errors) co
   const auto validate = [&](std::string_view key, const Value& value, ServiceValueType expected) {
     valid &= validate_value_type(key, value ? &*value : nullptr, expected, false, errors);
   };
-  validate("KTBundleIdentifier", bundleID(), ServiceValueType::String);
-  validate("KTBundleName", bundleName(), ServiceValueType::String);
-  validate("KTBundleVersion", bundleVersion(), ServiceValueType::String);
-  validate("QVServices", infoPlistServiceDictionaries(), ServiceValueType::Array);
+  validate(information_keys::identifier, bundleID(), ServiceValueType::String);
+  validate(information_keys::name, bundleName(), ServiceValueType::String);
+  validate(information_keys::version, bundleVersion(), ServiceValueType::String);
+  validate(information_keys::services, infoPlistServiceDictionaries(), ServiceValueType::Array);
   return valid;
 }
 
@@ -172,7 +173,8 @@ bool KELAppEntry::validateEntryPlistFormatOptionallyLoggingErrors(bool log) cons
   const Value services = infoPlistServiceDictionaries();
   if (valid && services) {
     for (const PropertyListValue& service : *services->asArray()) {
-      valid &= validate_value_type("QVServices", &service, ServiceValueType::Dictionary, true, errors) &&
+      valid &= validate_value_type(information_keys::services, &service, ServiceValueType::Dictionary, true,
+                                   errors) &&
                validate_service_dictionary(*service.asDictionary(), errors);
     }
   }

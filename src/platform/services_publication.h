@@ -7,6 +7,10 @@
 
 namespace kel::platform {
 
+/// The preferences domain that holds the published services, and the key of the publication in it.
+inline constexpr std::string_view publicationDomain = "com.orvex.ServicesMenu.Services";
+inline constexpr std::string_view publicationKey = "QVServices";
+
 /// The platform's list of services that applications see.
 class ServicesPublication {
  public:

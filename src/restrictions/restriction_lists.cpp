@@ -50,8 +50,8 @@ std::optional<PropertyListDictionary> load_restrictions_file(platform::FileSyste
                                                              platform::StandardDirectories& directories) {
   const std::vector<std::string> libraries = directories.systemLibraryDirectories();
   if (libraries.empty()) return std::nullopt;
-  const std::string path = platform::joinPath(platform::joinPath(libraries.back(), "CoreAgents"),
-                                              "com.orvex.QVServicesRestrictions.plist");
+  const std::string path =
+      platform::joinPath(platform::joinPath(libraries.back(), "CoreAgents"), restrictionsFileName);
   return platform::readDictionaryFile(files, path, platform::largestForeignFile).dictionary;
 }
 

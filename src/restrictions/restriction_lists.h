@@ -41,8 +41,11 @@ class ServiceView {
   const platform::PropertyListDictionaryBuilder* building_ = nullptr;
 };
 
-/// Reads the restrictions file, "CoreAgents/com.orvex.QVServicesRestrictions.plist" in the system's library
-/// directory, anew. None when there is no such file or it is no property list with a dictionary at its top.
+/// What the restrictions file is called, where it holds and where it is generated.
+inline constexpr const char* restrictionsFileName = "com.orvex.QVServicesRestrictions.plist";
+
+/// Reads the restrictions file, in "CoreAgents" of the system's library directory, anew. None when there is
+/// no such file or it is no property list with a dictionary at its top.
 std::optional<platform::PropertyListDictionary> load_restrictions_file(
     platform::FileSystem& files, platform::StandardDirectories& directories);
 

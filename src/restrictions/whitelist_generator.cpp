@@ -40,7 +40,7 @@ void removeBlacklisted(Entries& entries, platform::SystemLog& log) {
 }
 
 void writeRestrictionsFile(platform::Platform& platform, platform::BytesView bytes, std::ostream& out) {
-  const std::string name = "com.orvex.QVServicesRestrictions.plist";
+  const std::string name = restrictionsFileName;
   const std::optional<std::string> directory = platform.directories.temporaryDirectory();
   const std::string path = directory ? platform::joinPath(*directory, name) : name;
   const std::optional<std::string> error =
@@ -57,9 +57,10 @@ void writeRestrictionsFile(platform::Platform& platform, platform::BytesView byt
 void generate_whitelist(platform::Platform& platform, std::ostream& out) {
   if (running_from_launcher(platform.facts)) return;
   const std::optional<PropertyListValue> publication =
-      platform.preferences.value("com.orvex.ServicesMenu.Services", "QVServices");
+      platform.preferences.value(platform::publicationDomain, platform::publicationKey);
   if (!publication) {
-    out << "No services (com.orvex.ServicesMenu.Services missing or empty in QVServices preferences)\n";
+    out << "No services (" << platform::publicationDomain << " missing or empty in "
+        << platform::publicationKey << " preferences)\n";
     return;
   }
   KELRestrictionLists lists{vendorServicesOf(*publication), {}};

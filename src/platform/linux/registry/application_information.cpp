@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "platform/application_registry.h"
+#include "platform/bundles.h"
 #include "platform/file_system.h"
 
 namespace kel::platform {
@@ -21,7 +22,8 @@ InformationStatus informationStatus(const std::string& application) {
 std::uint32_t informationFlags(BytesView contents) {
   const PropertyListReading reading = readPropertyList(contents, bundleFileLimits);
   const PropertyListDictionary* dictionary = reading.value ? reading.value->asDictionary() : nullptr;
-  const PropertyListArray* services = dictionary ? array_value(*dictionary, "QVServices") : nullptr;
+  const PropertyListArray* services =
+      dictionary ? array_value(*dictionary, information_keys::services) : nullptr;
   return services && !services->empty() ? ApplicationRegistry::providesServices : 0;
 }
 
