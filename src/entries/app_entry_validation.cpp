@@ -3,7 +3,9 @@
 #include <algorithm>
 #include <array>
 
+#include "common/common.h"
 #include "entries/app_entry.h"
+#include "entries/service_key_table.h"
 #include "property_lists/unicode.h"
 
 namespace kel {
@@ -15,13 +17,16 @@ using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListValue;
 
-constexpr std::array<std::string_view, 8> string_service_keys{
-    "qvmessage", "qvhost",         "qvuserdata",       "qvtimeout",
-    "qvfilter",  "qvspellchecker", "qvinputmechanism", "qvportname"};
-constexpr std::array<std::string_view, 4> string_array_service_keys{"qvsendtypes", "qvreturntypes",
-                                                                    "qvsendfiletypes", "qvlanguages"};
-constexpr std::array<std::string_view, 2> localizable_service_keys{"qvmenuitem", "qvkeyequivalent"};
-constexpr std::array<std::string_view, 2> context_service_keys{"qvrequiredcontext", "qvforbiddencontext"};
+std::vector<std::string_view> keysWith(ServiceKeyRule rule) {
+  return map_array(service_keys::table, [rule](const ServiceKey& key) {
+    return key.rule == rule ? std::optional<std::string_view>(key.declared) : std::nullopt;
+  });
+}
+
+const auto string_service_keys = keysWith(ServiceKeyRule::String);
+const auto string_array_service_keys = keysWith(ServiceKeyRule::StringArray);
+const auto localizable_service_keys = keysWith(ServiceKeyRule::Localizable);
+const auto context_service_keys = keysWith(ServiceKeyRule::Context);
 constexpr std::array<std::string_view, 4> context_string_keys{"qvapplicationidentifier", "qvtextscript",
                                                               "qvtextlanguage", "qvtextcontent"};
 constexpr std::array<std::string_view, 1> context_number_keys{"qvwordlimit"};
