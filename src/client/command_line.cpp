@@ -63,6 +63,7 @@ std::variant<Invocation, int> parse(const std::vector<std::string>& arguments) {
     invocation.options.insert(option.value);
   }
   for (const std::string& argument : parser.remaining()) {
+    // Behind "--": what looks like an option was meant as one and is no language.
     if (argument.starts_with('-')) return 1;
     if (platform::isValidUTF8(argument)) invocation.localizations.push_back(argument);
   }
@@ -105,6 +106,7 @@ void run(const Invocation& invocation, platform::Platform& platform, std::ostrea
   if (invocation.has(Update))
     send_kel_command(platform, protocol::getAndUpdateServicesPlist, debug, printingDebug);
   if (invocation.has(Flush)) send_kel_command(platform, protocol::flush, debug, printingDebug);
+  // The post reaches the server through the same notification as a real change.
   if (invocation.has(MockRegistryChange)) {
     platform.seeds.post(platform::databaseChangeNotification);
     output << "Mocking complete\n";

@@ -14,6 +14,7 @@ std::string formatted(const char* call, const platform::SystemReading& reading) 
 }  // namespace
 
 const std::string& boot_session_id(platform::Platform& platform) {
+  // Once per process: a reading that fails later must not make a cache of this session look like another's.
   return platform.constants.bootSessionID.get([&platform] {
     const platform::SystemReading boot = platform.facts.bootTime();
     if (!boot.value) send_debug_line([&] { return formatted("sysctlbyname(\"kern.boottime\")", boot); });

@@ -1,3 +1,22 @@
+// What a restarted server still knows.
+//
+// The file holds what the last update learnt and the position in the journal from before that update. A
+// server loads it when it is first asked for anything and answers from it at once; what changed since that
+// position is found by the next update. Everything in it is therefore taken for valid: locators need no
+// listing, entries no bundle. A file of another build version, of the system's or of this program's, is no
+// file. One from an earlier boot or session still serves the first answer; the server then has everything
+// looked at.
+//
+// Reading is lenient in the small: one value of the wrong kind counts as absent, one odd element is passed
+// over, and nothing is validated. What can be made of a damaged entry is decided where it is used.
+//
+// Writing turns the store's contents into bytes on the calling queue and leaves the disk to `writeQueue_`,
+// with a transaction so that the launcher lets it finish. Files so appear in the order of the updates, and a
+// flush, which waits for that queue, deletes the last of them.
+//
+// Never happens: a file half written, because a complete one takes its place; a write that overtakes a flush;
+// a cache that keeps a change from being seen, because position and contents are written together.
+
 #include <utility>
 
 #include "common/common.h"
@@ -108,6 +127,7 @@ void KELDataStore::restoreLocators(const PropertyListDictionary& directories) {
     if (const PropertyListArray* array = paths.asArray()) {
       for (std::string& path : stringElements(*array)) locator->paths().insert(std::move(path));
     }
+    // As of the position stored with it: the next update asks the journal what came later.
     locator->setDirectoryContentsCacheIsValid(true);
     locators->emplace(directory.text(), std::move(locator));
   }
@@ -149,6 +169,7 @@ PropertyListValue KELDataStore::cacheFileContents() const {
 }
 
 void KELDataStore::writeCaches() {
+  // Serialised here and not on the other queue: entries may be changed as soon as this returns.
   auto written = std::make_shared<const platform::PropertyListWriting>(
       platform::writeBinaryPropertyList(cacheFileContents()));
   auto work = [&files = platform_.files, path = cacheFilePath(), written] {
@@ -179,6 +200,7 @@ void KELDataStore::flushCaches() {
   currentPublicDictionaries_ = std::nullopt;
   pathsToLocators_ = nullptr;
   pathsToAppEntries_ = nullptr;
+  // The registry's paths stay: their changes are told, and asked for, on their own.
   writeQueue_.sync([this] {
     if (const std::optional<std::string> path = cacheFilePath()) platform_.files.remove(*path);
   });

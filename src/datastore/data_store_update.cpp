@@ -1,3 +1,23 @@
+// What one update does, in this order.
+//
+// 1. It widens the flags by every source that nothing is known of yet. An empty list of paths counts as
+//    unknown: to ask again costs little, never to ask would cost the services.
+// 2. It reads the stale sources side by side: the service directories, the application registry, the
+//    restrictions file. The journal's position is taken before any of them is read: a change made meanwhile
+//    is seen by the next update, twice at worst. A position taken afterwards would lose it.
+// 3. It puts together the candidates, bundle paths from the registry and from all directories, and finds or
+//    makes the entry of each. An entry that is no candidate any more is not carried over.
+// 4. When directories were stale it asks the journal about the bundles of valid entries, and takes their
+//    validity from those that changed; from all of them where there is no position to ask from. A change
+//    within a bundle has left the listing of its directory valid: it costs that bundle alone.
+// 5. It loads every entry that is not valid, in parallel, drops those that cannot be loaded, and installs the
+//    rest. A bundle that dropped out has no entry, and so is tried again by the next update.
+//
+// Never happens: a list that is half old and half new, because the new entries are installed at once and this
+// queue is the only reader; a bundle read without need, unless the journal cannot tell; an update that fails:
+// a directory that cannot be listed counts as empty, and a missing restrictions file leaves the lists as they
+// were.
+
 #include <algorithm>
 #include <utility>
 
@@ -53,6 +73,7 @@ void KELDataStore::updateServicesCache(KELStaleCacheFlags flags) {
   }
   apply_concurrently(platform_.concurrentQueue, mapValues(entries),
                      [](const std::shared_ptr<KELAppEntry>& entry) { entry->refreshCache(); });
+  // Kept, an entry that failed would be taken for known by the next update, and its old values for true.
   std::erase_if(entries, [](const auto& item) { return !item.second->servicesCacheIsValid(); });
   pathsToAppEntries_ = std::make_shared<const AppEntries>(std::move(entries));
 }
@@ -115,6 +136,7 @@ std::shared_ptr<const KELDataStore::Locators> KELDataStore::refreshedLocators(
         locator = known->second;
       }
     }
+    // A new locator is listed in any case: there is nothing that the journal could keep valid.
     if (!locator) {
       locator = std::make_shared<KELServicesProviderLocator>(platform_.files, directory);
     } else if (locator->directoryContentsCacheIsValid()) {

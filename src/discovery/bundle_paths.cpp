@@ -25,6 +25,8 @@ std::string parent_directory(std::string_view path) {
 }
 
 std::vector<std::string> paths_to_observe(const std::vector<std::string>& paths) {
+  // Around fewer neighbours a directory may hold much that nobody asks about. From three on, one question
+  // about it is cheaper than one about each.
   constexpr std::size_t fewestToShareTheirParent = 3;
   std::unordered_map<std::string, std::size_t> countOfParent;
   for (const std::string& path : paths) ++countOfParent[parent_directory(path)];

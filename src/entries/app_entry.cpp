@@ -98,6 +98,7 @@ bool KELAppEntry::loadFromBundle(platform::Bundle* bundle) {
 
   const bool unchanged = identifier == bundleID() && name == bundleName() && version == bundleVersion() &&
                          services == infoPlistServiceDictionaries();
+  // Menu strings carry no date of their own. They are taken to have changed with the bundle's four values.
   if (!unchanged) localizationToMenuStrings_.with([](Value& strings) { strings.reset(); });
   setBundleID(std::move(identifier));
   setBundleName(std::move(name));
@@ -118,6 +119,7 @@ void KELAppEntry::loadLocalizations(const std::vector<std::string>& localization
       if (!isFalseMarker(*earlier)) break;
       continue;
     }
+    // Opened for the first localization that nothing is known of, and then for all.
     if (!bundle && !(bundle = createBundle())) break;
     PropertyListValue found = lookUpMenuStrings(*bundle, localization);
     const bool usable = !isFalseMarker(found);

@@ -1,3 +1,25 @@
+// From what a bundle declares to what clients see.
+//
+// A declared service is a dictionary that somebody wrote by hand: its keys come in any letter case and with
+// blanks in them. They are normalised first, and what the table of service keys does not know is dropped. Of
+// the rest the table says what is carried over as it is; message, titles, key equivalents, the restriction
+// and the identity are made here.
+//
+// Titles and key equivalents become dictionaries from the name of a localization to a text. The declared ones
+// stand in them first; the one under "default" is then looked up in every strings table that the entry has
+// loaded, and what is found takes its place under the table's localization. One table serves titles and key
+// equivalents alike.
+//
+// A service's identity is a digest of its bundle's path and its place in the declaration. So it outlives
+// restarts and updates of the bundle, and nothing about it has to be stored.
+//
+// Values are validated when they come from a bundle, but never when they come from the cache file, so that
+// everything here may be of any kind. What is odd inside a service is left out of it; what makes a service
+// impossible ends its bundle's services with a line in the log, and those before it stay.
+//
+// Never happens: a value is copied, since public dictionaries share what was declared; one bundle fills the
+// list, since its services are counted at full size however much they share.
+
 #include <algorithm>
 #include <array>
 #include <map>
@@ -103,7 +125,7 @@ bool textAsBoolean(std::string_view text) {
   };
   dropLeading(" \t\n\v\f\r");
   if (text.starts_with('+') || text.starts_with('-')) text.remove_prefix(1);
-  dropLeading("0");
+  dropLeading("0");  // "007" is true by its 7
   return !text.empty() && std::string_view("YyTt123456789").find(text.front()) != std::string_view::npos;
 }
 
@@ -163,6 +185,7 @@ PropertyListDictionaryBuilder KELAppEntry::transformServiceDictionaryForPlist(
   if (const PropertyListValue* restricted = declared.find(service_keys::QVRestricted))
     service.set(service_keys::QVRestricted, asBoolean(*restricted));
 
+  // An empty title is still one; an empty key equivalent in a dictionary means none.
   PropertyListDictionaryBuilder titles = declaredTitles(declared.find(service_keys::QVMenuItem), true);
   PropertyListDictionaryBuilder keyEquivalents =
       declaredTitles(declared.find(service_keys::QVKeyEquivalent), false);

@@ -154,6 +154,7 @@ bool validate_context(std::string_view key, const PropertyListValue* value, bool
 }
 
 bool validate_service_dictionary(const PropertyListDictionary& service, ValidationErrors* errors) {
+  // No short cut: whoever mends a bundle wants to know of all that is wrong with it.
   bool valid = true;
   for (const auto& [key, value] : service) valid &= validateServiceKey(key.text(), value, errors);
   return valid;
@@ -176,6 +177,7 @@ bool KELAppEntry::validateEntryPlistFormatOptionallyLoggingErrors(bool log) cons
   ValidationErrors* errors = log ? &list : nullptr;
   bool valid = validateBaseServiceKeysIntoErrors(errors);
   const Value services = infoPlistServiceDictionaries();
+  // When they are no array there is nothing to walk; when the name is no string the bundle is lost already.
   if (valid && services) {
     for (const PropertyListValue& service : *services->asArray()) {
       valid &= validate_value_type(information_keys::services, &service, ServiceValueType::Dictionary, true,

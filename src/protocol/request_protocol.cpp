@@ -23,6 +23,7 @@ KELCommand classify_request(const PropertyListDictionary& request) {
     if (*name == protocol::getServicesPlist) return KELCommand::KELCommandGetServicesPlist;
     if (*name == protocol::getAndUpdateServicesPlist) return KELCommand::KELCommandGetAndUpdateServicesPlist;
   }
+  // A command that is unknown or no string is passed over: the request may still name localizations.
   const PropertyListArray* names = array_value(request, protocol::localizations);
   const auto isString = [](const PropertyListValue& value) { return value.asString() != nullptr; };
   return names && std::all_of(names->begin(), names->end(), isString) ? KELCommand::KELCommandLocalizations
@@ -55,6 +56,7 @@ void send_kel_command(platform::Platform& platform, std::string_view command, bo
 void send_kel_payload(platform::Platform& platform, const PropertyListDictionary& request,
                       const ReplyPrinter& printer) {
   constexpr const char* routine = "send_kel_payload";
+  // The queue comes first: it outlives the connection, whose errors arrive on it while this thread waits.
   platform::SerialQueue queue("kel contact queue");
   const std::shared_ptr<platform::ConduitConnection> connection =
       platform.conduit.connect(endpointName, queue);
@@ -86,6 +88,7 @@ std::string unknown_message_type(std::string_view routine, std::string_view subj
   if (const auto* message = std::get_if<std::shared_ptr<platform::ConduitMessage>>(&event)) {
     return unknown_message_type(routine, subject, (*message)->contents());
   }
+  // Addresses that stand for the kinds that are no values, as `typeAddress` does for those that are.
   static constexpr char connectionType = 0;
   static constexpr char errorType = 0;
   if (const auto* error = std::get_if<ConduitError>(&event)) {

@@ -34,6 +34,7 @@ class EntrySet {
   }
 
  private:
+  // Views into the entries, which outlive the set.
   std::unordered_map<std::string_view, std::set<std::string_view>> identifiers_;
 };
 
@@ -79,6 +80,7 @@ void apply_restriction_lists(std::vector<PropertyListDictionaryBuilder>& service
   const EntrySet unrestricted((lists ? *lists : none).unrestricted);
   const EntrySet restricted((lists ? *lists : none).restricted);
   for (PropertyListDictionaryBuilder& service : services) {
+    // What the bundle declares holds, even when it is false.
     if (service.find(service_keys::QVRestricted)) continue;
     const std::optional<KELRestrictionListEntry> entry = restriction_entry_for_service(service);
     if (!entry) continue;

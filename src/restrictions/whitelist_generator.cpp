@@ -33,6 +33,7 @@ void removeBlacklisted(Entries& entries, platform::SystemLog& log) {
   for (const auto& [bundleID, title] : default_blacklist) {
     const auto row =
         KELRestrictionListEntry::initWithBundleID(PropertyListString(bundleID), PropertyListString(title));
+    // A row that names nothing may be a service that was renamed and now slips through.
     if (std::erase(entries, *row) > 0) continue;
     log.write("Blacklisted Service '" + std::string(bundleID) + ":" + std::string(title) +
               "' not found. Perhaps the blacklist needs to be updated?");
