@@ -18,7 +18,6 @@ namespace {
 
 constexpr const char* usageLine =
     "Usage: kel [-debug] [-dump] [-dump_cache] [-update] [-flush] language1 language2...";
-constexpr const char* databaseChangeNotification = "com.orvex.AppRegistry.DatabaseChange";
 
 enum OptionValue : int {
   Help = 1,
@@ -65,6 +64,7 @@ std::variant<Invocation, int> parse(const std::vector<std::string>& arguments) {
     invocation.options.insert(option.value);
   }
   for (const std::string& argument : parser.remaining()) {
+    // Behind "--": what looks like an option was meant as one and is no language.
     if (argument.starts_with('-')) return 1;
     if (platform::isValidUTF8(argument)) invocation.localizations.push_back(argument);
   }
@@ -107,8 +107,9 @@ void run(const Invocation& invocation, platform::Platform& platform, std::ostrea
   if (invocation.has(Update))
     send_kel_command(platform, protocol::getAndUpdateServicesPlist, debug, printingDebug);
   if (invocation.has(Flush)) send_kel_command(platform, protocol::flush, debug, printingDebug);
+  // The post reaches the server through the same notification as a real change.
   if (invocation.has(MockRegistryChange)) {
-    platform.seeds.post(databaseChangeNotification);
+    platform.seeds.post(platform::databaseChangeNotification);
     output << "Mocking complete\n";
   }
   if (invocation.has(DumpCache)) dumpCache(platform, output);
@@ -142,12 +143,10 @@ void print_reply(const platform::ConduitReply& reply, PrintedData printedData, s
     output << unknown_message_type("print_reply", "reply", contents) << "\n";
     return;
   }
-  const PropertyListValue* debugOutput = dictionary->find(protocol::debugOutput);
-  if (debugOutput && debugOutput->asString()) output << *debugOutput->asString() << "\n";
-  const PropertyListValue* data = dictionary->find(protocol::data);
-  if (printedData == PrintedData::No || !data || !data->asData()) return;
-  const platform::PropertyListReading list =
-      platform::readPropertyList(**data->asData(), platform::ownLimits);
+  if (const std::string* lines = string_value(*dictionary, protocol::debugOutput)) output << *lines << "\n";
+  const auto* data = typed_value<&PropertyListValue::asData>(*dictionary, protocol::data);
+  if (printedData == PrintedData::No || !data) return;
+  const platform::PropertyListReading list = platform::readPropertyList(**data, platform::ownLimits);
   if (list.value) {
     output << platform::describe(*list.value) << "\n";
   } else {

@@ -19,11 +19,10 @@ std::optional<std::string> cache_file_path(platform::StandardDirectories& direct
 /// The directories whose bundles offer services without being registered, in order, each with a trailing "/".
 std::vector<std::string> explicit_service_directories(platform::StandardDirectories& directories);
 
-/// The results of `transform` (an optional or a pointer-like value) that are present, in the order of
-/// `elements`.
+/// The results of `transform` (optionals or pointers) that are present, in the order of `elements`.
 template <typename Elements, typename Transform>
 auto map_array(const Elements& elements, Transform&& transform) {
-  std::vector<typename std::decay_t<decltype(transform(*elements.begin()))>::value_type> results;
+  std::vector<std::remove_cvref_t<decltype(*transform(*elements.begin()))>> results;
   for (const auto& element : elements) {
     if (auto result = transform(element)) results.push_back(std::move(*result));
   }

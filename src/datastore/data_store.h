@@ -6,7 +6,6 @@
 #include <optional>
 #include <set>
 #include <string>
-#include <string_view>
 #include <vector>
 
 #include "common/queue_depths.h"
@@ -108,27 +107,5 @@ class KELDataStore {
   platform::EventID eventStreamID_ = 0;
   bool cacheIsLoaded_ = false;
 };
-
-/// The identity of this boot and login session, computed once per process.
-const std::string& boot_session_id(platform::Platform& platform);
-
-/// The value of `key`, or null when it is absent or not of the expected kind; a boolean counts as a number.
-enum class ValueKind { Dictionary, Array, String, Number, Any };
-const platform::PropertyListValue* typed_value(const platform::PropertyListDictionary& dictionary,
-                                               std::string_view key, ValueKind expected);
-const platform::PropertyListDictionary* dictionary_value(const platform::PropertyListDictionary& dictionary,
-                                                         std::string_view key);
-const platform::PropertyListArray* array_value(const platform::PropertyListDictionary& dictionary,
-                                               std::string_view key);
-
-/// The paths of the registered applications that provide services, in the registry's order.
-std::vector<std::string> service_providing_paths(platform::Platform& platform);
-
-/// What to watch so that changes in any of `paths` are seen: a directory in place of three or more paths in
-/// it, and nothing that lies under something else that is watched.
-std::vector<std::string> paths_to_observe(const std::vector<std::string>& paths);
-
-/// `path` without its last component, ending in "/".
-std::string parent_directory(std::string_view path);
 
 }  // namespace kel

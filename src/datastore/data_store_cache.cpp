@@ -1,6 +1,26 @@
+// What a restarted server still knows.
+//
+// The file holds what the last update learnt and the position in the journal from before that update. A
+// server loads it when it is first asked for anything and answers from it at once; what changed since that
+// position is found by the next update. Everything in it is therefore taken for valid: locators need no
+// listing, entries no bundle. A file of another build version, of the system's or of this program's, is no
+// file. One from an earlier boot or session still serves the first answer; the server then has everything
+// looked at.
+//
+// Reading is lenient in the small: one value of the wrong kind counts as absent, one odd element is passed
+// over, and nothing is validated. What can be made of a damaged entry is decided where it is used.
+//
+// Writing turns the store's contents into bytes on the calling queue and leaves the disk to `writeQueue_`,
+// with a transaction so that the launcher lets it finish. Files so appear in the order of the updates, and a
+// flush, which waits for that queue, deletes the last of them.
+//
+// Never happens: a file half written, because a complete one takes its place; a write that overtakes a flush;
+// a cache that keeps a change from being seen, because position and contents are written together.
+
 #include <utility>
 
 #include "common/common.h"
+#include "datastore/boot_session.h"
 #include "datastore/data_store.h"
 
 namespace kel {
@@ -22,62 +42,14 @@ constexpr const char* buildVersionKey = "QVServicesBuildVersion";
 
 /// The strings of an array; elements of other kinds are no paths and are passed over.
 std::vector<std::string> stringElements(const PropertyListArray& array) {
-  return map_array(array, [](const PropertyListValue& element) {
-    const std::string* text = element.asString();
-    return text ? std::optional(*text) : std::nullopt;
-  });
+  return map_array(array, [](const PropertyListValue& element) { return element.asString(); });
 }
 
 PropertyListValue arrayOfStrings(const auto& strings) {
   return PropertyListArray(strings.begin(), strings.end());
 }
 
-std::string formatted(const char* call, const platform::SystemReading& reading) {
-  return std::string(call) + " failed with errno " + std::to_string(reading.errorNumber) + " (" +
-         reading.errorText + ")";
-}
-
 }  // namespace
-
-const std::string& boot_session_id(platform::Platform& platform) {
-  return platform.constants.bootSessionID.get([&platform] {
-    const platform::SystemReading boot = platform.facts.bootTime();
-    if (!boot.value) send_debug_line([&] { return formatted("sysctlbyname(\"kern.boottime\")", boot); });
-    const platform::SystemReading session = platform.facts.auditSession();
-    if (!session.value) send_debug_line([&] { return formatted("getaudit_addr()", session); });
-    return std::to_string(boot.value.value_or(0)) + "," + std::to_string(session.value.value_or(0));
-  });
-}
-
-const PropertyListValue* typed_value(const PropertyListDictionary& dictionary, std::string_view key,
-                                     ValueKind expected) {
-  const PropertyListValue* value = dictionary.find(key);
-  if (!value) return nullptr;
-  switch (expected) {
-    case ValueKind::Dictionary:
-      return value->asDictionary() ? value : nullptr;
-    case ValueKind::Array:
-      return value->asArray() ? value : nullptr;
-    case ValueKind::String:
-      return value->asString() ? value : nullptr;
-    case ValueKind::Number:
-      return value->isNumber() ? value : nullptr;
-    case ValueKind::Any:
-      return value;
-  }
-  return nullptr;
-}
-
-const PropertyListDictionary* dictionary_value(const PropertyListDictionary& dictionary,
-                                               std::string_view key) {
-  const PropertyListValue* value = typed_value(dictionary, key, ValueKind::Dictionary);
-  return value ? value->asDictionary() : nullptr;
-}
-
-const PropertyListArray* array_value(const PropertyListDictionary& dictionary, std::string_view key) {
-  const PropertyListValue* value = typed_value(dictionary, key, ValueKind::Array);
-  return value ? value->asArray() : nullptr;
-}
 
 std::unique_ptr<KELDataStore> KELDataStore::initWithSystemServices(platform::Platform& platform) {
   return std::unique_ptr<KELDataStore>(new KELDataStore(platform));
@@ -92,8 +64,8 @@ const std::string& KELDataStore::operatingSystemBuildVersion() const {
 }
 
 bool KELDataStore::validateCacheDictionaryVersion(const PropertyListDictionary& dictionary) const {
-  const PropertyListValue* version = typed_value(dictionary, buildVersionKey, ValueKind::String);
-  return version && *version->asString() == operatingSystemBuildVersion();
+  const std::string* version = string_value(dictionary, buildVersionKey);
+  return version && *version == operatingSystemBuildVersion();
 }
 
 std::optional<PropertyListDictionary> KELDataStore::cacheDictionary() const {
@@ -121,13 +93,12 @@ void KELDataStore::loadCache() {
   const PropertyListDictionary cache = cacheDictionary().value_or(PropertyListDictionary());
   send_debug_line([&] { return "Cache contains " + std::to_string(cache.size()) + " keys"; });
 
-  if (const PropertyListValue* eventID = typed_value(cache, lastEventIDKey, ValueKind::Number)) {
-    eventStreamID_ = eventID->asUnsigned64().value_or(0);
+  if (const auto eventID = typed_value<&PropertyListValue::asUnsigned64>(cache, lastEventIDKey)) {
+    eventStreamID_ = *eventID;
     send_debug_line([&] { return "EventStreamID was " + std::to_string(eventStreamID_); });
   }
 
-  const PropertyListValue* sessionID = typed_value(cache, sessionIDKey, ValueKind::String);
-  cacheSessionID_ = sessionID ? std::optional(*sessionID->asString()) : std::nullopt;
+  cacheSessionID_ = platform::copied(string_value(cache, sessionIDKey));
 
   const PropertyListDictionary* lists = dictionary_value(cache, restrictionListsKey);
   restrictionLists_ = restriction_lists_from_plist(
@@ -156,6 +127,7 @@ void KELDataStore::restoreLocators(const PropertyListDictionary& directories) {
     if (const PropertyListArray* array = paths.asArray()) {
       for (std::string& path : stringElements(*array)) locator->paths().insert(std::move(path));
     }
+    // As of the position stored with it: the next update asks the journal what came later.
     locator->setDirectoryContentsCacheIsValid(true);
     locators->emplace(directory.text(), std::move(locator));
   }
@@ -197,6 +169,7 @@ PropertyListValue KELDataStore::cacheFileContents() const {
 }
 
 void KELDataStore::writeCaches() {
+  // Serialised here and not on the other queue: entries may be changed as soon as this returns.
   auto written = std::make_shared<const platform::PropertyListWriting>(
       platform::writeBinaryPropertyList(cacheFileContents()));
   auto work = [&files = platform_.files, path = cacheFilePath(), written] {
@@ -227,6 +200,7 @@ void KELDataStore::flushCaches() {
   currentPublicDictionaries_ = std::nullopt;
   pathsToLocators_ = nullptr;
   pathsToAppEntries_ = nullptr;
+  // The registry's paths stay: their changes are told, and asked for, on their own.
   writeQueue_.sync([this] {
     if (const std::optional<std::string> path = cacheFilePath()) platform_.files.remove(*path);
   });

@@ -40,8 +40,7 @@ void KELDataStore::removeInvalidSpellCheckers(std::vector<PropertyListDictionary
   const std::vector<std::string>& validPaths = validPathsForSpellCheckers();
   std::erase_if(services, [&](const PropertyListDictionaryBuilder& service) {
     if (!service.find(service_keys::QVSpellChecker)) return false;
-    const PropertyListValue* bundlePath = service.find(service_keys::QVBundlePath);
-    const std::string* path = bundlePath ? bundlePath->asString() : nullptr;
+    const std::string* path = string_value(service, service_keys::QVBundlePath);
     return !path || std::none_of(validPaths.begin(), validPaths.end(),
                                  [path](const std::string& valid) { return path->starts_with(valid); });
   });
@@ -54,6 +53,7 @@ std::vector<std::shared_ptr<KELAppEntry>> KELDataStore::uniquedAppEntries() cons
   for (const auto& [path, entry] : pathsToAppEntries_ ? *pathsToAppEntries_ : AppEntries()) {
     const std::optional<std::string> identifier = identifierText(*entry);
     if (!identifier) {
+      // Sorted as a missing identifier prints. Two bundles without one are no copies of each other.
       result.emplace_back("(null)", entry);
       continue;
     }
@@ -82,6 +82,7 @@ const PropertyListValue& KELDataStore::currentPublicDictionaries() {
     if (size > largestList) {
       platform_.log.write("The services list is full; leaving out the services of " + entry->bundlePath() +
                           " and of what sorts after it");
+      // Not the next, smaller bundle instead: what is left out should not change with every update.
       services.resize(before);
       break;
     }

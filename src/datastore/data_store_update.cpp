@@ -1,11 +1,30 @@
+// What one update does, in this order.
+//
+// 1. It widens the flags by every source that nothing is known of yet. An empty list of paths counts as
+//    unknown: to ask again costs little, never to ask would cost the services.
+// 2. It reads the stale sources side by side: the service directories, the application registry, the
+//    restrictions file. The journal's position is taken before any of them is read: a change made meanwhile
+//    is seen by the next update, twice at worst. A position taken afterwards would lose it.
+// 3. It puts together the candidates, bundle paths from the registry and from all directories, and finds or
+//    makes the entry of each. An entry that is no candidate any more is not carried over.
+// 4. When directories were stale it asks the journal about the bundles of valid entries, and takes their
+//    validity from those that changed; from all of them where there is no position to ask from. A change
+//    within a bundle has left the listing of its directory valid: it costs that bundle alone.
+// 5. It loads every entry that is not valid, in parallel, drops those that cannot be loaded, and installs the
+//    rest. A bundle that dropped out has no entry, and so is tried again by the next update.
+//
+// Never happens: a list that is half old and half new, because the new entries are installed at once and this
+// queue is the only reader; a bundle read without need, unless the journal cannot tell; an update that fails:
+// a directory that cannot be listed counts as empty, and a missing restrictions file leaves the lists as they
+// were.
+
 #include <algorithm>
-#include <unordered_map>
-#include <unordered_set>
 #include <utility>
 
 #include "common/common.h"
 #include "common/path_set.h"
 #include "datastore/data_store.h"
+#include "discovery/bundle_paths.h"
 
 namespace kel {
 
@@ -36,46 +55,6 @@ bool hasChanged(const std::string& path, KELPathChangesObserver* observer) {
 
 }  // namespace
 
-std::vector<std::string> service_providing_paths(platform::Platform& platform) {
-  constexpr std::uint32_t mask = platform::ApplicationRegistry::providesServices;
-  std::vector<std::string> paths =
-      map_array(platform.applications.applications(mask, mask),
-                [](const platform::RegisteredApplication& application) { return application.path; });
-  send_debug_line([&] { return "Service providing paths:\n\t" + join(paths, "\n\t"); });
-  return paths;
-}
-
-std::string parent_directory(std::string_view path) {
-  while (path.size() > 1 && path.ends_with('/')) path.remove_suffix(1);
-  path = path.substr(0, path.rfind('/') + 1);
-  return path.empty() ? "/" : std::string(path);
-}
-
-std::vector<std::string> paths_to_observe(const std::vector<std::string>& paths) {
-  constexpr std::size_t fewestToShareTheirParent = 3;
-  std::unordered_map<std::string, std::size_t> countOfParent;
-  for (const std::string& path : paths) ++countOfParent[parent_directory(path)];
-
-  std::unordered_set<std::string> chosen;
-  for (const std::string& path : paths) {
-    std::string parent = parent_directory(path);
-    chosen.insert(countOfParent[parent] >= fewestToShareTheirParent ? std::move(parent) : path);
-  }
-
-  // An ancestor ends in "/", so an element has one exactly when a shorter element that ends in "/" is its
-  // prefix.
-  PathSet possibleAncestors;
-  for (const std::string& path : chosen) {
-    if (path.ends_with('/')) possibleAncestors.insert(path);
-  }
-  std::vector<std::string> result;
-  for (const std::string& path : chosen) {
-    const std::string* ancestor = possibleAncestors.shortestPrefixOf(path);
-    if (!ancestor || *ancestor == path) result.push_back(path);
-  }
-  return result;
-}
-
 void KELDataStore::updateServicesCache(KELStaleCacheFlags flags) {
   if (!cacheIsLoaded_) loadCache();
   flags = widenedFlags(flags);
@@ -94,6 +73,7 @@ void KELDataStore::updateServicesCache(KELStaleCacheFlags flags) {
   }
   apply_concurrently(platform_.concurrentQueue, mapValues(entries),
                      [](const std::shared_ptr<KELAppEntry>& entry) { entry->refreshCache(); });
+  // Kept, an entry that failed would be taken for known by the next update, and its old values for true.
   std::erase_if(entries, [](const auto& item) { return !item.second->servicesCacheIsValid(); });
   pathsToAppEntries_ = std::make_shared<const AppEntries>(std::move(entries));
 }
@@ -156,6 +136,7 @@ std::shared_ptr<const KELDataStore::Locators> KELDataStore::refreshedLocators(
         locator = known->second;
       }
     }
+    // A new locator is listed in any case: there is nothing that the journal could keep valid.
     if (!locator) {
       locator = std::make_shared<KELServicesProviderLocator>(platform_.files, directory);
     } else if (locator->directoryContentsCacheIsValid()) {

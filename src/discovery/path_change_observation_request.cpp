@@ -24,6 +24,7 @@ bool KELPathChangeObservationRequest::runWithPaths(const std::vector<std::string
   eventStream_ =
       journal_.createStream(std::move(callback), paths, streamID, std::chrono::nanoseconds::zero(), flags);
   if (!eventStream_) return false;
+  // The second try, without watching roots, uses it again.
   if (!queue_) queue_.emplace("kel VigilStream");
   eventStream_->setQueue(*queue_);
   if (!eventStream_->start()) {
@@ -43,6 +44,7 @@ void KELPathChangeObservationRequest::receive(const std::vector<JournalEvent>& e
   queue_->assertCurrent();
   if (finished_) return;
   for (const JournalEvent& event : events) {
+    // No "else" behind this: such an event may also end the history, or name a path.
     if (event.flags & event_flags::eventIDsWrapped) {
       mustDoFullScan_ = eventIDsWrapped_ = finished_ = true;
     }
@@ -59,6 +61,7 @@ void KELPathChangeObservationRequest::receive(const std::vector<JournalEvent>& e
 
 void KELPathChangeObservationRequest::stop() {
   if (!eventStream_) return;
+  // On its queue, between two batches: none is under way when this returns.
   queue_->sync([this] {
     eventStream_->stop();
     eventStream_->invalidate();

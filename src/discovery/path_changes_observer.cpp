@@ -1,3 +1,23 @@
+// What the journal's answers are taken for.
+//
+// An update asks twice, about its directories and then about its bundles, and every question costs a replay
+// of the journal. A path that is observed already, itself or a directory above it, is not asked about again.
+// The answers pile up in two sets: the paths that changed, and those that the journal cannot tell the changes
+// of and that need a full scan. For the second the paths asked about count, not those that the events name:
+// an event says "somewhere here", and all that was asked lies under suspicion.
+//
+// All tests are plain tests of prefixes, in both directions. A path has changed when an element is a prefix
+// of it; beneath a path lies every element that it is a prefix of. Directories end in "/", so that no
+// neighbour with a longer name is meant.
+//
+// A replay that does not end in time leaves its paths observed and unchanged. That is a choice: to read every
+// bundle again would make a slow machine slower, and the journal promises to answer in a third of that time.
+// What it would have told is seen when it changes again, or when everything is read.
+//
+// Never happens: an answer that is read while it still arrives, because the request takes no more events once
+// it has signalled; a stream that outlives its question, because every question stops its request before it
+// returns.
+
 #include "discovery/path_changes_observer.h"
 
 #include <chrono>

@@ -20,6 +20,7 @@ void KELServicesProviderLocator::refreshCache() {
   for (const std::string& name : files_.listDirectory(basePath_).value_or(std::vector<std::string>())) {
     if (!name.empty() && !name.starts_with('.')) paths_.insert(platform::joinPath(basePath_, name));
   }
+  // Even when it could not be listed: a missing directory is not tried again until the journal tells of it.
   directoryContentsCacheIsValid_ = true;
 }
 

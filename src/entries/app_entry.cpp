@@ -14,6 +14,7 @@ namespace {
 // their names come from clients, and there may be any number of them.
 constexpr std::size_t mostRemembered = 256;
 
+namespace information_keys = platform::information_keys;
 using platform::PropertyListDictionary;
 using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListString;
@@ -24,11 +25,6 @@ const PropertyListString nameKey = "name";
 const PropertyListString versionKey = "vers";
 const PropertyListString servicesKey = "service_dicts";
 const PropertyListString menuStringsKey = "loc_to_menu_strings";
-
-KELAppEntry::Value valueUnder(const PropertyListDictionary& dictionary, std::string_view key) {
-  const PropertyListValue* value = dictionary.find(key);
-  return value ? std::optional(*value) : std::nullopt;
-}
 
 bool isFalseMarker(const PropertyListValue& value) { return value.asBoolean() == false; }
 
@@ -50,11 +46,11 @@ std::shared_ptr<KELAppEntry> KELAppEntry::initFromCacheRepresentation(platform::
   const PropertyListDictionary* fields = representation ? representation->asDictionary() : nullptr;
   if (!fields) return nullptr;
   auto entry = initWithBundlePath(platform, std::move(bundlePath));
-  entry->setBundleID(valueUnder(*fields, bundleIDKey.text()));
-  entry->setBundleName(valueUnder(*fields, nameKey.text()));
-  entry->setBundleVersion(valueUnder(*fields, versionKey.text()));
-  entry->setInfoPlistServiceDictionaries(valueUnder(*fields, servicesKey.text()));
-  entry->setLocalizationToMenuStrings(valueUnder(*fields, menuStringsKey.text()));
+  entry->setBundleID(copied(fields->find(bundleIDKey)));
+  entry->setBundleName(copied(fields->find(nameKey)));
+  entry->setBundleVersion(copied(fields->find(versionKey)));
+  entry->setInfoPlistServiceDictionaries(copied(fields->find(servicesKey)));
+  entry->setLocalizationToMenuStrings(copied(fields->find(menuStringsKey)));
   return entry;
 }
 
@@ -96,12 +92,13 @@ bool KELAppEntry::loadFromBundle(platform::Bundle* bundle) {
   if (!bundle) return false;
   Value identifier = bundle->identifier();
   const PropertyListDictionary information = bundle->informationDictionary();
-  Value name = valueUnder(information, "KTBundleName");
-  Value version = valueUnder(information, "KTBundleVersion");
-  Value services = valueUnder(information, "QVServices");
+  Value name = copied(information.find(information_keys::name));
+  Value version = copied(information.find(information_keys::version));
+  Value services = copied(information.find(information_keys::services));
 
   const bool unchanged = identifier == bundleID() && name == bundleName() && version == bundleVersion() &&
                          services == infoPlistServiceDictionaries();
+  // Menu strings carry no date of their own. They are taken to have changed with the bundle's four values.
   if (!unchanged) localizationToMenuStrings_.with([](Value& strings) { strings.reset(); });
   setBundleID(std::move(identifier));
   setBundleName(std::move(name));
@@ -122,6 +119,7 @@ void KELAppEntry::loadLocalizations(const std::vector<std::string>& localization
       if (!isFalseMarker(*earlier)) break;
       continue;
     }
+    // Opened for the first localization that nothing is known of, and then for all.
     if (!bundle && !(bundle = createBundle())) break;
     PropertyListValue found = lookUpMenuStrings(*bundle, localization);
     const bool usable = !isFalseMarker(found);

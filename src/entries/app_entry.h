@@ -96,9 +96,6 @@ class KELAppEntry {
   /// The bundle's directory, exactly as the entry was created with.
   const std::string& bundlePath() const { return bundlePath_.text(); }
 
-  /// The identity that the UUIDs of the bundle's services derive from; always the same for one path.
-  const platform::Digest& app_id() const { return app_id_; }
-
   /// The fields reflect the bundle on disk and passed validation.
   bool servicesCacheIsValid() const { return servicesCacheIsValid_; }
   void setServicesCacheIsValid(bool valid) { servicesCacheIsValid_ = valid; }
@@ -120,7 +117,7 @@ class KELAppEntry {
 
   platform::Platform& platform_;
   const platform::PropertyListString bundlePath_;
-  const platform::Digest app_id_;
+  const platform::Digest app_id_;  // always the same for one path; its services' UUIDs derive from it
 
   platform::Guarded<Value> bundleID_;
   platform::Guarded<Value> bundleName_;

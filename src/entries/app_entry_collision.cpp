@@ -42,6 +42,7 @@ Preference preferredPath(const std::vector<std::string>& directories, const std:
   if (firstPosition != secondPosition) return {firstPosition < secondPosition, "directory precedence"};
   const bool firstIsElsewhere = first.starts_with("/Volumes/");
   if (firstIsElsewhere != second.starts_with("/Volumes/")) return {!firstIsElsewhere, "boot volume"};
+  // Last of all the path that is nearer to the root, counted as the platform counts characters.
   return {platform::utf16Length(first) <= platform::utf16Length(second), "path length"};
 }
 

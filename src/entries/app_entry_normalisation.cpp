@@ -1,11 +1,33 @@
+// From what a bundle declares to what clients see.
+//
+// A declared service is a dictionary that somebody wrote by hand: its keys come in any letter case and with
+// blanks in them. They are normalised first, and what the table of service keys does not know is dropped. Of
+// the rest the table says what is carried over as it is; message, titles, key equivalents, the restriction
+// and the identity are made here.
+//
+// Titles and key equivalents become dictionaries from the name of a localization to a text. The declared ones
+// stand in them first; the one under "default" is then looked up in every strings table that the entry has
+// loaded, and what is found takes its place under the table's localization. One table serves titles and key
+// equivalents alike.
+//
+// A service's identity is a digest of its bundle's path and its place in the declaration. So it outlives
+// restarts and updates of the bundle, and nothing about it has to be stored.
+//
+// Values are validated when they come from a bundle, but never when they come from the cache file, so that
+// everything here may be of any kind. What is odd inside a service is left out of it; what makes a service
+// impossible ends its bundle's services with a line in the log, and those before it stay.
+//
+// Never happens: a value is copied, since public dictionaries share what was declared; one bundle fills the
+// list, since its services are counted at full size however much they share.
+
 #include <algorithm>
 #include <array>
 #include <map>
 #include <stdexcept>
 #include <utility>
 
-#include "common/service_keys.h"
 #include "entries/app_entry.h"
+#include "entries/service_key_table.h"
 #include "property_lists/unicode.h"
 
 namespace kel {
@@ -40,85 +62,53 @@ std::optional<std::string> normalisedKey(std::string_view key) {
   return platform::lowerCase(result);
 }
 
-/// A declared service by normalised keys. Borrows its values.
+/// The declared values of a service that count, by the names their keys are published under. Borrows them.
 class DeclaredService {
  public:
   explicit DeclaredService(const PropertyListDictionary& declared) {
     for (const auto& [key, value] : declared) {
-      if (std::optional<std::string> normalised = normalisedKey(key.text()))
-        values_.emplace(*std::move(normalised), &value);
+      const std::optional<std::string> normalised = normalisedKey(key);
+      for (const ServiceKey& known : service_keys::table)
+        if (known.declared == normalised) values_.emplace(known.published, &value);
     }
+    // An earlier kind of service hides the later ones, and only filters translate.
+    if (find(service_keys::QVSpellChecker)) values_.erase(service_keys::QVFilter);
+    if (!find(service_keys::QVFilter)) {
+      values_.erase(service_keys::QVSupportsFileTranslation);
+      values_.erase(service_keys::QVSupportsDataTranslation);
+    }
+    // Send types of the wrong kind hide the languages too.
+    if (find(service_keys::QVSendTypes)) values_.erase(service_keys::QVLanguages);
   }
 
   /// The declared value, or null.
-  const PropertyListValue* find(std::string_view normalisedKey) const {
-    const auto found = values_.find(normalisedKey);
+  const PropertyListValue* find(std::string_view published) const {
+    const auto found = values_.find(published);
     return found == values_.end() ? nullptr : found->second;
   }
 
  private:
-  // Ordered, not hashed: keys are the bundle's choice.
-  std::map<std::string, const PropertyListValue*, std::less<>> values_;
+  std::map<std::string_view, const PropertyListValue*> values_;
 };
 
-bool isAnything(const PropertyListValue&) { return true; }
-bool isString(const PropertyListValue& value) { return value.asString() != nullptr; }
-bool isArray(const PropertyListValue& value) { return value.asArray() != nullptr; }
-
-/// A key whose value is carried over when it passes a test.
-struct CarriedKey {
-  std::string_view declared;
-  const PropertyListString& published;
-  bool (*test)(const PropertyListValue&);
-};
-
-const std::array<CarriedKey, 9> carriedKeys{{
-    {"qvportname", service_keys::QVPortName, isString},
-    {"qvinputmechanism", service_keys::QVInputMechanism, isAnything},
-    {"qvhost", service_keys::QVHost, isString},
-    {"qvrequiredcontext", service_keys::QVRequiredContext, isAnything},
-    {"qvforbiddencontext", service_keys::QVForbiddenContext, isAnything},
-    {"qvuserdata", service_keys::QVUserData, isString},
-    {"qvtimeout", service_keys::QVTimeout, isAnything},
-    {"qvsendfiletypes", service_keys::QVSendFileTypes, isAnything},
-    {"qvreturntypes", service_keys::QVReturnTypes, isArray},
-}};
-
-void carryOver(const DeclaredService& declared, const CarriedKey& key,
-               PropertyListDictionaryBuilder& service) {
-  const PropertyListValue* value = declared.find(key.declared);
-  if (value && key.test(*value)) service.set(key.published, *value);
+void carryOver(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
+  for (const ServiceKey& key : service_keys::table) {
+    const PropertyListValue* value = declared.find(key.published);
+    if (value && key.isCarriedOver(*value)) service.set(key.published, *value);
+  }
 }
 
-void addKindAndMessage(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
-  const PropertyListValue* message = nullptr;
-  if ((message = declared.find("qvspellchecker"))) {
-    service.set(service_keys::QVSpellChecker, *message);
-  } else if ((message = declared.find("qvfilter"))) {
-    service.set(service_keys::QVFilter, *message);
-    carryOver(declared, {"qvsupportsfiletranslation", service_keys::QVSupportsFileTranslation, isAnything},
-              service);
-    carryOver(declared, {"qvsupportsdatatranslation", service_keys::QVSupportsDataTranslation, isAnything},
-              service);
-  } else {
-    message = declared.find("qvmessage");
-  }
-  if (message && isString(*message)) service.set(service_keys::QVMessage, *message);
-}
-
-void addSendTypesOrLanguages(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
-  // Send types of the wrong kind hide the languages too.
-  if (declared.find("qvsendtypes")) {
-    carryOver(declared, {"qvsendtypes", service_keys::QVSendTypes, isArray}, service);
-  } else {
-    carryOver(declared, {"qvlanguages", service_keys::QVLanguages, isArray}, service);
-  }
+void addMessage(const DeclaredService& declared, PropertyListDictionaryBuilder& service) {
+  const PropertyListValue* message = declared.find(service_keys::QVSpellChecker);
+  if (!message) message = declared.find(service_keys::QVFilter);
+  if (!message) message = declared.find(service_keys::QVMessage);
+  if (message && message->asString()) service.set(service_keys::QVMessage, *message);
 }
 
 PropertyListDictionaryBuilder declaredTitles(const PropertyListValue* declared, bool keepEmpty) {
   PropertyListDictionaryBuilder titles;
   if (!declared) return titles;
-  if (isString(*declared)) {
+  if (declared->asString()) {
     titles.set(service_keys::defaultTitle, *declared);
   } else if (const PropertyListDictionary* pairs = declared->asDictionary()) {
     for (const auto& [localization, title] : *pairs) {
@@ -135,7 +125,7 @@ bool textAsBoolean(std::string_view text) {
   };
   dropLeading(" \t\n\v\f\r");
   if (text.starts_with('+') || text.starts_with('-')) text.remove_prefix(1);
-  dropLeading("0");
+  dropLeading("0");  // "007" is true by its 7
   return !text.empty() && std::string_view("YyTt123456789").find(text.front()) != std::string_view::npos;
 }
 
@@ -188,16 +178,17 @@ PropertyListDictionaryBuilder KELAppEntry::transformServiceDictionaryForPlist(
   const DeclaredService declared(*dictionary);
 
   PropertyListDictionaryBuilder service;
-  addKindAndMessage(declared, service);
+  carryOver(declared, service);
+  addMessage(declared, service);
   service.set(service_keys::QVBundlePath, bundlePath_);
   if (Value identifier = bundleID()) service.set(service_keys::QVBundleIdentifier, *std::move(identifier));
-  for (const CarriedKey& key : carriedKeys) carryOver(declared, key, service);
-  addSendTypesOrLanguages(declared, service);
-  if (const PropertyListValue* restricted = declared.find("qvrestricted"))
+  if (const PropertyListValue* restricted = declared.find(service_keys::QVRestricted))
     service.set(service_keys::QVRestricted, asBoolean(*restricted));
 
-  PropertyListDictionaryBuilder titles = declaredTitles(declared.find("qvmenuitem"), true);
-  PropertyListDictionaryBuilder keyEquivalents = declaredTitles(declared.find("qvkeyequivalent"), false);
+  // An empty title is still one; an empty key equivalent in a dictionary means none.
+  PropertyListDictionaryBuilder titles = declaredTitles(declared.find(service_keys::QVMenuItem), true);
+  PropertyListDictionaryBuilder keyEquivalents =
+      declaredTitles(declared.find(service_keys::QVKeyEquivalent), false);
   applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(titles, tables);
   applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(keyEquivalents, tables);
   service.set(service_keys::QVMenuItem, titles.build());
@@ -214,7 +205,7 @@ void KELAppEntry::applyAvailableLocalizationsToMenuItemNamesOrKeyEquivalents(
   // A copy: a localization may itself be called "default".
   const PropertyListString defaultTitle = *found->asSharedString();
   for (const auto& [localization, table] : tables.tables) {
-    if (const PropertyListValue* translation = table.asDictionary()->find(defaultTitle.text()))
+    if (const PropertyListValue* translation = table.asDictionary()->find(defaultTitle))
       titles.set(localization, *translation);
   }
 }

@@ -3,24 +3,30 @@
 #include <algorithm>
 #include <array>
 
+#include "common/common.h"
 #include "entries/app_entry.h"
+#include "entries/service_key_table.h"
 #include "property_lists/unicode.h"
 
 namespace kel {
 
 namespace {
 
+namespace information_keys = platform::information_keys;
 using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListValue;
 
-constexpr std::array<std::string_view, 8> string_service_keys{
-    "qvmessage", "qvhost",         "qvuserdata",       "qvtimeout",
-    "qvfilter",  "qvspellchecker", "qvinputmechanism", "qvportname"};
-constexpr std::array<std::string_view, 4> string_array_service_keys{"qvsendtypes", "qvreturntypes",
-                                                                    "qvsendfiletypes", "qvlanguages"};
-constexpr std::array<std::string_view, 2> localizable_service_keys{"qvmenuitem", "qvkeyequivalent"};
-constexpr std::array<std::string_view, 2> context_service_keys{"qvrequiredcontext", "qvforbiddencontext"};
+std::vector<std::string_view> keysWith(ServiceKeyRule rule) {
+  return map_array(service_keys::table, [rule](const ServiceKey& key) {
+    return key.rule == rule ? std::optional<std::string_view>(key.declared) : std::nullopt;
+  });
+}
+
+const auto string_service_keys = keysWith(ServiceKeyRule::String);
+const auto string_array_service_keys = keysWith(ServiceKeyRule::StringArray);
+const auto localizable_service_keys = keysWith(ServiceKeyRule::Localizable);
+const auto context_service_keys = keysWith(ServiceKeyRule::Context);
 constexpr std::array<std::string_view, 4> context_string_keys{"qvapplicationidentifier", "qvtextscript",
                                                               "qvtextlanguage", "qvtextcontent"};
 constexpr std::array<std::string_view, 1> context_number_keys{"qvwordlimit"};
@@ -148,6 +154,7 @@ bool validate_context(std::string_view key, const PropertyListValue* value, bool
 }
 
 bool validate_service_dictionary(const PropertyListDictionary& service, ValidationErrors* errors) {
+  // No short cut: whoever mends a bundle wants to know of all that is wrong with it.
   bool valid = true;
   for (const auto& [key, value] : service) valid &= validateServiceKey(key.text(), value, errors);
   return valid;
@@ -158,10 +165,10 @@ bool KELAppEntry::validateBaseServiceKeysIntoErrors(ValidationErrors* errors) co
   const auto validate = [&](std::string_view key, const Value& value, ServiceValueType expected) {
     valid &= validate_value_type(key, value ? &*value : nullptr, expected, false, errors);
   };
-  validate("KTBundleIdentifier", bundleID(), ServiceValueType::String);
-  validate("KTBundleName", bundleName(), ServiceValueType::String);
-  validate("KTBundleVersion", bundleVersion(), ServiceValueType::String);
-  validate("QVServices", infoPlistServiceDictionaries(), ServiceValueType::Array);
+  validate(information_keys::identifier, bundleID(), ServiceValueType::String);
+  validate(information_keys::name, bundleName(), ServiceValueType::String);
+  validate(information_keys::version, bundleVersion(), ServiceValueType::String);
+  validate(information_keys::services, infoPlistServiceDictionaries(), ServiceValueType::Array);
   return valid;
 }
 
@@ -170,9 +177,11 @@ bool KELAppEntry::validateEntryPlistFormatOptionallyLoggingErrors(bool log) cons
   ValidationErrors* errors = log ? &list : nullptr;
   bool valid = validateBaseServiceKeysIntoErrors(errors);
   const Value services = infoPlistServiceDictionaries();
+  // When they are no array there is nothing to walk; when the name is no string the bundle is lost already.
   if (valid && services) {
     for (const PropertyListValue& service : *services->asArray()) {
-      valid &= validate_value_type("QVServices", &service, ServiceValueType::Dictionary, true, errors) &&
+      valid &= validate_value_type(information_keys::services, &service, ServiceValueType::Dictionary, true,
+                                   errors) &&
                validate_service_dictionary(*service.asDictionary(), errors);
     }
   }

@@ -3,7 +3,7 @@
 namespace kel::platform {
 
 std::optional<PropertyListValue> bundleIdentifier(const PropertyListDictionary& informationDictionary) {
-  const PropertyListValue* identifier = informationDictionary.find("KTBundleIdentifier");
+  const PropertyListValue* identifier = informationDictionary.find(information_keys::identifier);
   return identifier ? std::optional(*identifier) : std::nullopt;
 }
 

@@ -10,6 +10,14 @@
 
 namespace kel::platform {
 
+/// Keys of information dictionaries.
+namespace information_keys {
+inline constexpr std::string_view identifier = "KTBundleIdentifier";
+inline constexpr std::string_view name = "KTBundleName";
+inline constexpr std::string_view version = "KTBundleVersion";
+inline constexpr std::string_view services = "QVServices";
+}  // namespace information_keys
+
 /// An opened bundle; closed by destruction. One thread at a time.
 class Bundle {
  public:

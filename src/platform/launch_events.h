@@ -7,6 +7,16 @@
 
 namespace kel::platform {
 
+/// Posted when the application registry's database has changed.
+inline constexpr const char* databaseChangeNotification = "com.orvex.AppRegistry.DatabaseChange";
+
+/// The names of the streams.
+namespace launch_streams {
+inline constexpr const char* databaseChanges = "com.orvex.beacond.matching";
+inline constexpr const char* seedingComplete = "com.orvex.broadcastd.matching";
+inline constexpr const char* directoryChanges = "com.orvex.vigil.matching";
+}  // namespace launch_streams
+
 /// The streams through which the launcher forwards notifications to the server.
 class LaunchEvents {
  public:

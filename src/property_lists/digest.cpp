@@ -42,6 +42,8 @@ class MD5 {
   }
 
   Digest finish() {
+    // The message ends in a one bit, zeros up to a whole block, and its length: one block more where they do
+    // not fit into the last.
     const std::uint64_t bits = length_ * 8;
     std::array<std::uint8_t, blockSize + 8> padding{0x80};
     const std::size_t zeros = (2 * blockSize - 8 - 1 - filled_) % blockSize;
@@ -99,6 +101,7 @@ Digest md5(BytesView bytes) {
 
 Digest hmacMD5(BytesView key, BytesView message) {
   Block inner{};
+  // A key is brought to the length of a block: a longer one as its digest, a shorter one with zeros.
   if (key.size() > blockSize) {
     const Digest shortened = md5(key);
     std::copy(shortened.begin(), shortened.end(), inner.begin());

@@ -36,9 +36,9 @@ PropertyListReading readBinaryPropertyList(BytesView bytes, const PropertyListLi
 PropertyListReading readXMLPropertyList(BytesView bytes, const PropertyListLimits& limits = {});
 PropertyListReading readTextPropertyList(BytesView bytes, const PropertyListLimits& limits = {});
 
-/// A binary property list in pieces, or one line that says why it cannot be written: the value nests deeper
-/// than a reader accepts (512). Large data objects are not copied: their pieces are the value's own shared
-/// buffers.
+/// A binary property list in pieces, or one line that says why it cannot be written: the value exceeds what
+/// `ownLimits` lets a reader accept, in depth or in expanded size. Large data objects are not copied: their
+/// pieces are the value's own shared buffers.
 struct PropertyListPieces {
   std::vector<SharedSlice> pieces;
   std::size_t size = 0;

@@ -1,3 +1,22 @@
+// How a binary property list is read.
+//
+// A file is a row of objects, a table of their offsets, and a trailer that says how wide offsets and
+// references are. A container holds references: indexes into the table. The reader begins with the top object
+// and resolves what is referred to. A leaf becomes a value at once. A container is opened: it goes onto the
+// stack `open_`, its keys and its finished values onto two more; when its last reference is resolved it is
+// closed into a value. What nothing refers to is never looked at.
+//
+// `slots_` knows of every object whether it is unread, under construction or decoded. A decoded string, data
+// or container is shared by all who refer to it; numbers are cheaper to decode again than to keep. A
+// reference to what is under construction is a container within itself.
+//
+// Never happens: recursion, because a file may nest as deeply as it is long; a read outside the bytes,
+// because every count is compared with the bytes that are left before anything is multiplied by it; work
+// beyond the budget. Objects may overlap, and references share them, so that a small file can stand for a
+// value larger than any memory. Therefore every byte decoded and every reference followed is charged. What is
+// charged never exceeds the expanded size of the top value, so that nothing is refused for it that would not
+// be refused at the end.
+
 #include <algorithm>
 #include <bit>
 #include <cstring>
@@ -21,10 +40,6 @@ std::uint64_t bigEndianNumber(BytesView bytes) {
   return number;
 }
 
-// Objects are decoded when a container first refers to them, so what nothing refers to is never looked at.
-// A container under construction stands on an explicit stack; its keys and finished values lie on two
-// more. Overlapping objects could make the work far larger than the file; therefore every byte decoded and
-// every reference followed is charged to the budget, which is a lower bound of the top value's expanded size.
 class BinaryReader {
  public:
   BinaryReader(BytesView bytes, const PropertyListLimits& limits)
@@ -33,6 +48,7 @@ class BinaryReader {
   PropertyListValue read() {
     const std::uint64_t top = readTrailer();
     slots_.resize(count_, unread);
+    // The trailer's count is only bounded by the table: reserve no more than the bytes make likely.
     decoded_.reserve(std::min<std::size_t>(count_, bytes_.size() / 16));
     budget_.spend(PropertyListBudget::valueCost, headerSize);
     resolve(top, bytes_.size() - 16);
@@ -79,6 +95,7 @@ class BinaryReader {
     const std::uint64_t table = number(trailer + 24, 8);
     if (table < headerSize || table > trailer) throw Malformed{trailer + 24, "offset table out of range"};
     objectsEnd_ = table;
+    // Divided, not multiplied: the count may be any 64 bits.
     if (count_ > (trailer - objectsEnd_) / offsetSize_ || count_ >= UINT32_MAX - firstDecoded) {
       throw Malformed{trailer + 8, "more objects than the offset table has room for"};
     }
@@ -157,6 +174,7 @@ class BinaryReader {
         closed.isDictionary
             ? PropertyListValue(takeDictionary(keys_, closed.firstKey, values_, closed.firstValue))
             : PropertyListValue(takeArray(values_, closed.firstValue));
+    // Again, for what it refers to may have been decoded elsewhere, at less depth.
     budget_.checkDepth(value.depth(), closed.position);
     budget_.checkSize(value.expandedSize(), closed.position);
     remember(closed.object, value);

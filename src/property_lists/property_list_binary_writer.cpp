@@ -1,3 +1,22 @@
+// How a binary property list is written.
+//
+// In two passes. The first numbers the objects, breadth first: `objects_` is at once the list of objects and
+// the queue of containers to look into, each of which adds what it refers to at the end. `references_`
+// gathers the numbers by which containers refer, one container's behind the other's. The second pass writes
+// the objects by number, takes each container's references off the front of that row, and ends with offsets
+// and trailer; the widths of both, the smallest that serve, are known by then.
+//
+// Equal strings, numbers, booleans, dates and data are one object. `byContents_` finds it by a hash under a
+// key of this process, so that no bundle can choose texts that collide; the full comparison decides.
+// `byAddress_` is asked first: a part that is shared, as the keys of a thousand services are, is hashed once.
+// Containers are never made one: to compare them would cost more than the bytes it saves.
+//
+// Never happens: other bytes for an equal value, because numbers follow from the contents and their order
+// alone and never from what is shared, from addresses or from the hash; a file that this program's reader
+// refuses, because depth and expanded size are checked before anything is written; a number beyond 32 bits,
+// for the same reason; a copy of large data when the result is made in pieces: the value's own buffer is one
+// of them.
+
 #include <algorithm>
 #include <bit>
 #include <variant>
@@ -13,8 +32,6 @@ namespace {
 
 /// Data objects above this size become pieces of their own instead of being copied.
 constexpr std::size_t largeData = 4096;
-
-/// Above this a value is not written: its objects would not fit into memory.
 
 /// Object numbers by hash, with open addressing.
 class NumberTable {
@@ -62,9 +79,6 @@ class NumberTable {
   std::size_t count_ = 0;
 };
 
-// Objects get their numbers breadth first: the list of objects is also the queue of containers to look into,
-// and the references of all containers lie one after the other in the order in which they are written. The
-// numbers depend on the value's contents alone, never on what its parts share.
 class BinaryWriter {
  public:
   explicit BinaryWriter(std::size_t largestCopied) : largestCopied_(largestCopied) {}
@@ -105,6 +119,7 @@ class BinaryWriter {
   using Object = std::variant<const std::string*, const PropertyListValue*>;
 
   void numberObjects(const PropertyListValue& top) {
+    // The trailer names object 0 as the top one.
     if (top.asArray() || top.asDictionary()) {
       objects_.push_back(&top);
     } else {
@@ -165,6 +180,7 @@ class BinaryWriter {
   }
 
   std::uint32_t numberScalar(std::uint64_t bits, const PropertyListValue& value) {
+    // With its kind: the integer 1 and the date of the same bits are two objects.
     std::uint8_t bytes[9] = {static_cast<std::uint8_t>(value.kind())};
     for (std::size_t i = 0; i < 8; ++i) bytes[1 + i] = static_cast<std::uint8_t>(bits >> 8 * i);
     return numberByContents(keyedHash(bytes), &value);
@@ -237,6 +253,7 @@ class BinaryWriter {
   }
 
   void writeInteger(PropertyListInteger integer) {
+    // Eight bytes are read as signed.
     if (!integer.isNegative && integer.bits >> 63 != 0) {
       appendNumber(0x14, 1);
       appendNumber(0, 8);

@@ -1,3 +1,17 @@
+// How values are printed.
+//
+// The form is the text encoding, so that what `-dump` prints can be read back. That encoding knows strings,
+// data and containers only: numbers, booleans and dates come out as bare or quoted strings, and reading gives
+// strings. Keys stand in their ascending order, every part on its own line, four blanks deeper than the
+// container it is in.
+//
+// The walk keeps the containers it is in on a stack of its own and asks after every part whether enough was
+// printed. Indentation makes that necessary: a value of 512 levels has lines of 2,000 blanks, and a log line
+// about a hostile message must not be hundreds of times as long as the message.
+//
+// Never happens: a control character in the output, whoever declared it, because it goes to a terminal or
+// into a log; a cut within a character; two ways to print one value.
+
 #include <algorithm>
 #include <charconv>
 #include <chrono>

@@ -1,3 +1,19 @@
+// From bytes to values: what the XML and the text encoding share.
+//
+// The bytes are decoded first. A mark says UTF-16, which is converted; all else must be UTF-8 and is used in
+// place. From then on there is only well-formed UTF-8, and positions in it become line and column when
+// something is wrong. A reader names the parts of the value in the order of the file, and the assembly puts
+// them together: `open_` is the stack of containers that were begun, and the keys and values of all of them
+// lie on two common stacks, the innermost one's last. Closing a container takes its own off these and places
+// the result in the container around it.
+//
+// The keys of one service are those of the next thousand. Short strings are therefore shared through a table
+// of fixed size, where a new one takes the place of another: a table that grew would have to be defended
+// against keys chosen to collide, and to have forgotten a string costs no more than its copy.
+//
+// Never happens: recursion, because a foreign file may nest as deeply as it is long; a part that is kept
+// before its size was charged to the budget; a position that points into anything but the decoded text.
+
 #include <algorithm>
 #include <cstring>
 
@@ -102,6 +118,7 @@ PropertyListDictionary takeDictionary(std::vector<PropertyListString>& keys, std
 PropertyListString SharedStrings::get(std::string_view text) {
   constexpr std::size_t longestShared = 64;
   if (text.size() > longestShared) return text;
+  // Both ends of the text decide on its slot: keys have long common beginnings.
   std::uint64_t ends[2] = {};
   const std::size_t taken = std::min(text.size(), sizeof ends[0]);
   std::memcpy(&ends[0], text.data(), taken);
@@ -143,6 +160,7 @@ PropertyListReading malformedAt(std::string_view text, const MalformedPropertyLi
 }
 
 bool isASCII(std::string_view text) {
+  // Eight bytes at a time: every string that is read or written passes here.
   std::uint64_t seen = 0;
   for (; text.size() >= sizeof seen; text.remove_prefix(sizeof seen)) {
     std::uint64_t block;

@@ -63,6 +63,7 @@ class TextReader {
     skipBlanks();
     const bool holdsString = !atEnd() && !isNext('{') && !isNext('(') && !isNext('<');
     const std::size_t start = position_;
+    // Which of the two it is shows only behind the string, so that it may be read twice.
     if (holdsString) {
       PropertyListString string = readString();
       skipBlanks();
@@ -92,6 +93,7 @@ class TextReader {
     PropertyListString key = readString();
     assembly_.setKey(key, start);
     skipBlanks();
+    // A key alone stands for itself, as strings files have it for what needs no translation.
     if (isNext(';')) {
       assembly_.add(std::move(key), start);
       return endValue();
@@ -154,6 +156,7 @@ class TextReader {
   PropertyListString readString() {
     if (isNext('"') || isNext('\'')) return readQuoted();
     const std::size_t start = position_;
+    // A path is a bare string, but "//" and "/*" within one begin a comment.
     while (!atEnd() && isBare(text_[position_]) && !(isNext('/') && beginsComment())) ++position_;
     if (position_ == start) fail(atEnd() ? "unexpected end" : "unexpected character");
     return strings_.get(text_.substr(start, position_ - start));

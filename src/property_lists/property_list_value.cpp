@@ -10,6 +10,8 @@ namespace kel::platform {
 
 namespace {
 
+// A value's expanded size and depth are summed up when it is built. Nobody who holds a value that came from
+// outside need walk it to learn that it is too large to be walked.
 constexpr std::uint64_t valueCost = 8;
 
 std::uint64_t addSaturating(std::uint64_t a, std::uint64_t b) {
@@ -94,6 +96,7 @@ std::optional<std::uint64_t> PropertyListValue::asUnsigned64() const {
   if (const auto boolean = asBoolean()) return *boolean ? 1 : 0;
   if (const auto integer = asInteger()) return integer->bits;
   if (const auto real = asReal()) {
+    // Not a number, too; and what is out of range must not be cast.
     if (!(*real > 0)) return 0;
     return *real >= 0x1p64 ? std::numeric_limits<std::uint64_t>::max() : static_cast<std::uint64_t>(*real);
   }
@@ -134,6 +137,7 @@ bool PropertyListValue::operator==(const PropertyListValue& other) const {
     case Kind::Date:
       return std::bit_cast<std::uint64_t>(asDate()->secondsSince2001) ==
              std::bit_cast<std::uint64_t>(other.asDate()->secondsSince2001);
+    // Shared parts are equal without being looked at.
     case Kind::Data:
       return *asData() == *other.asData() || **asData() == **other.asData();
     case Kind::Array:

@@ -29,6 +29,7 @@ class PropertyListString {
   PropertyListString(const char* text) : PropertyListString(std::string(text)) {}
 
   const std::string& text() const { return *text_; }
+  operator std::string_view() const { return *text_; }
 
   bool operator==(const PropertyListString& other) const {
     return text_ == other.text_ || *text_ == *other.text_;
@@ -158,7 +159,7 @@ class PropertyListDictionaryBuilder {
   }
 
   /// The value under `key`, or null; valid until the key is set again.
-  const PropertyListValue* find(const PropertyListString& key) const {
+  const PropertyListValue* find(std::string_view key) const {
     const auto found = entries_.find(key);
     return found == entries_.end() ? nullptr : &found->second;
   }
@@ -172,7 +173,37 @@ class PropertyListDictionaryBuilder {
   PropertyListDictionary build() const;
 
  private:
-  std::map<PropertyListString, PropertyListValue> entries_;
+  struct ByText {
+    using is_transparent = void;
+    bool operator()(std::string_view a, std::string_view b) const { return a < b; }
+  };
+  std::map<PropertyListString, PropertyListValue, ByText> entries_;
 };
+
+/// What `kind`, one of the `as...` of a value, gives of the value under `key`; null or absent when there is
+/// none. `dictionary` is whatever has a `find` like the two above, and keeps the value alive.
+template <auto kind>
+auto typed_value(const auto& dictionary, std::string_view key) {
+  const PropertyListValue* value = dictionary.find(key);
+  return value ? (value->*kind)() : decltype((value->*kind)())();
+}
+const std::string* string_value(const auto& dictionary, std::string_view key) {
+  return typed_value<&PropertyListValue::asString>(dictionary, key);
+}
+const PropertyListString* shared_string_value(const auto& dictionary, std::string_view key) {
+  return typed_value<&PropertyListValue::asSharedString>(dictionary, key);
+}
+const PropertyListArray* array_value(const auto& dictionary, std::string_view key) {
+  return typed_value<&PropertyListValue::asArray>(dictionary, key);
+}
+const PropertyListDictionary* dictionary_value(const auto& dictionary, std::string_view key) {
+  return typed_value<&PropertyListValue::asDictionary>(dictionary, key);
+}
+
+/// A copy of what `pointer` points to; none for null.
+template <typename T>
+std::optional<T> copied(const T* pointer) {
+  return pointer ? std::optional<T>(*pointer) : std::nullopt;
+}
 
 }  // namespace kel::platform

@@ -35,11 +35,13 @@ std::optional<PropertyListInteger> parseInteger(std::string_view text) {
   const auto [stop, error] = std::from_chars(text.data(), end, magnitude, isHexadecimal ? 16 : 10);
   if (error != std::errc() || stop != end) return std::nullopt;
   if (!isNegative || magnitude == 0) return PropertyListInteger{magnitude, false};
+  // A negative one has 63 bits and the smallest; a positive one may need all 64.
   if (magnitude > std::uint64_t{1} << 63) return std::nullopt;
   return PropertyListInteger{0 - magnitude, true};
 }
 
 std::optional<double> parseReal(std::string_view text) {
+  // from_chars takes no "+". The "nan(...)" that it takes is refused below.
   if (text.starts_with('+')) {
     text.remove_prefix(1);
     if (text.starts_with('-')) return std::nullopt;

@@ -40,11 +40,13 @@ std::size_t decode(std::string_view text, char32_t& character) {
     if ((next & 0xC0) != 0x80) return 0;
     character = character << 6 | (next & 0x3FU);
   }
+  // Two ways to write one character would make two keys of one name.
   const bool overlong = (length == 3 && character < 0x800) || (length == 4 && character < 0x10000);
   return overlong || isSurrogate(character) || character > 0x10FFFF ? 0 : length;
 }
 
 std::size_t asciiPrefix(std::string_view text) {
+  // Nearly all text is ASCII: eight bytes at a time, through a copy, because a text lies at any address.
   std::size_t position = 0;
   for (std::uint64_t block; position + sizeof block <= text.size(); position += sizeof block) {
     std::memcpy(&block, text.data() + position, sizeof block);
@@ -69,6 +71,7 @@ bool isValidUTF8(std::string_view text) {
   for (;;) {
     text.remove_prefix(asciiPrefix(text));
     if (text.empty()) return true;
+    // One by one until ASCII begins again: blocks are no use in other scripts.
     do {
       const std::size_t length = decode(text, character);
       if (length == 0) return false;

@@ -1,3 +1,17 @@
+// What of XML is understood.
+//
+// A property list needs tags and text. The scanner gives them to the reader in one pass over the decoded
+// text, without a tree, and skips what says nothing about the value: the declaration, the document type,
+// comments, processing instructions, attributes. Except for the document type, what is skipped must be
+// well-formed all the same: a file that other programs refuse shall not work here by luck.
+//
+// A text is handed out as a view of the input for as long as it stands there as it is. Only a reference, a
+// carriage return, a comment or a CDATA section in it makes a copy, in `gathered_`.
+//
+// Never happens: anything is fetched, for neither the document type nor an entity is looked up anywhere; an
+// entity grows, for what a document type declares is skipped unread, the five predefined ones are all there
+// are, and none stands for more bytes than it is written with.
+
 #include "property_lists/xml_scanner.h"
 
 #include <algorithm>
@@ -74,6 +88,7 @@ void XMLScanner::checkCharacters() const {
   for (std::size_t position = 0; position < text_.size(); ++position) {
     const auto byte = static_cast<unsigned char>(text_[position]);
     const bool isControl = byte < 0x20 && !isXMLBlank(text_[position]);
+    // U+FFFE and U+FFFF; surrogates cannot occur in well-formed UTF-8.
     const bool isNoncharacter = byte == 0xEF && text_.substr(position + 1, 2) >= "\xBF\xBE";
     if (isControl || isNoncharacter) failAt(position, "a character that XML does not allow");
   }
@@ -125,6 +140,7 @@ void XMLScanner::skipDeclaration() {
 
 void XMLScanner::skipDocumentType() {
   const std::size_t start = position_;
+  // A ">" ends it only outside of the internal subset, of literals and of comments.
   bool inSubset = false;
   while (!atEnd()) {
     if (isNext("<!--")) {
@@ -285,7 +301,7 @@ char32_t XMLScanner::readCharacterReference() {
     const int digit = hexadecimalDigit(text_[position_]);
     if (digit < 0 || digit >= base) break;
     character = character * static_cast<char32_t>(base) + static_cast<char32_t>(digit);
-    character = std::min<char32_t>(character, 0x110000);
+    character = std::min<char32_t>(character, 0x110000);  // never overflows, always refused
   }
   if (position_ == firstDigit || !skip(";")) failAt(start, "malformed character reference");
   if (!isXMLCharacter(character)) failAt(start, "a character that XML does not allow");

@@ -1,6 +1,7 @@
 #include "protocol/request_protocol.h"
 
 #include <algorithm>
+#include <span>
 #include <sstream>
 #include <utility>
 
@@ -17,14 +18,13 @@ using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListValue;
 
 KELCommand classify_request(const PropertyListDictionary& request) {
-  const PropertyListValue* command = request.find(protocol::command);
-  if (const std::string* name = command ? command->asString() : nullptr) {
+  if (const std::string* name = string_value(request, protocol::command)) {
     if (*name == protocol::flush) return KELCommand::KELCommandFlush;
     if (*name == protocol::getServicesPlist) return KELCommand::KELCommandGetServicesPlist;
     if (*name == protocol::getAndUpdateServicesPlist) return KELCommand::KELCommandGetAndUpdateServicesPlist;
   }
-  const PropertyListValue* localizations = request.find(protocol::localizations);
-  const PropertyListArray* names = localizations ? localizations->asArray() : nullptr;
+  // A command that is unknown or no string is passed over: the request may still name localizations.
+  const PropertyListArray* names = array_value(request, protocol::localizations);
   const auto isString = [](const PropertyListValue& value) { return value.asString() != nullptr; };
   return names && std::all_of(names->begin(), names->end(), isString) ? KELCommand::KELCommandLocalizations
                                                                       : KELCommand::KELCommandInvalid;
@@ -35,20 +35,14 @@ bool refused_to_sandboxed(KELCommand command) {
 }
 
 bool wants_debug(const PropertyListDictionary& request) {
-  const PropertyListValue* debug = request.find(protocol::debug);
-  return debug && debug->asBoolean().value_or(false);
+  return typed_value<&PropertyListValue::asBoolean>(request, protocol::debug).value_or(false);
 }
 
 std::vector<std::string> requested_localizations(const PropertyListDictionary& request) {
-  const PropertyListValue* localizations = request.find(protocol::localizations);
-  const PropertyListArray* array = localizations ? localizations->asArray() : nullptr;
-  if (!array) return {};
-  const PropertyListArray first(
-      array->begin(),
-      array->begin() + static_cast<std::ptrdiff_t>(std::min(array->size(), mostRequestedLocalizations)));
-  return map_array(first, [](const PropertyListValue& name) {
-    return name.asString() ? std::optional(*name.asString()) : std::nullopt;
-  });
+  const PropertyListArray* names = array_value(request, protocol::localizations);
+  if (!names) return {};
+  const std::span first(names->begin(), std::min(names->size(), mostRequestedLocalizations));
+  return map_array(first, [](const PropertyListValue& name) { return name.asString(); });
 }
 
 void send_kel_command(platform::Platform& platform, std::string_view command, bool debug,
@@ -62,6 +56,7 @@ void send_kel_command(platform::Platform& platform, std::string_view command, bo
 void send_kel_payload(platform::Platform& platform, const PropertyListDictionary& request,
                       const ReplyPrinter& printer) {
   constexpr const char* routine = "send_kel_payload";
+  // The queue comes first: it outlives the connection, whose errors arrive on it while this thread waits.
   platform::SerialQueue queue("kel contact queue");
   const std::shared_ptr<platform::ConduitConnection> connection =
       platform.conduit.connect(endpointName, queue);
@@ -93,6 +88,7 @@ std::string unknown_message_type(std::string_view routine, std::string_view subj
   if (const auto* message = std::get_if<std::shared_ptr<platform::ConduitMessage>>(&event)) {
     return unknown_message_type(routine, subject, (*message)->contents());
   }
+  // Addresses that stand for the kinds that are no values, as `typeAddress` does for those that are.
   static constexpr char connectionType = 0;
   static constexpr char errorType = 0;
   if (const auto* error = std::get_if<ConduitError>(&event)) {

@@ -1,7 +1,5 @@
 #include "restrictions/restriction_list_entry.h"
 
-#include <functional>
-#include <string>
 #include <utility>
 
 #include "common/service_keys.h"
@@ -15,13 +13,6 @@ using platform::PropertyListString;
 using platform::PropertyListValue;
 
 const PropertyListString bundleIDKey = "QVBundleID";
-
-std::optional<PropertyListString> stringUnder(const PropertyListDictionary& dictionary,
-                                              const PropertyListString& key) {
-  const PropertyListValue* value = dictionary.find(key.text());
-  const PropertyListString* string = value ? value->asSharedString() : nullptr;
-  return string ? std::optional(*string) : std::nullopt;
-}
 
 }  // namespace
 
@@ -38,13 +29,12 @@ std::optional<KELRestrictionListEntry> KELRestrictionListEntry::initWithDictiona
     const PropertyListValue& representation) {
   const PropertyListDictionary* row = representation.asDictionary();
   if (!row) return std::nullopt;
-  return initWithBundleID(stringUnder(*row, bundleIDKey), stringUnder(*row, service_keys::QVMenuItem));
+  return initWithBundleID(copied(shared_string_value(*row, bundleIDKey)),
+                          copied(shared_string_value(*row, service_keys::QVMenuItem)));
 }
 
 PropertyListDictionary KELRestrictionListEntry::dictionaryRepresentation() const {
   return PropertyListDictionary({{bundleIDKey, bundleID_}, {service_keys::QVMenuItem, title_}});
 }
-
-std::size_t KELRestrictionListEntry::hash() const { return std::hash<std::string>{}(title_.text()); }
 
 }  // namespace kel

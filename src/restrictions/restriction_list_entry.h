@@ -1,6 +1,5 @@
 #pragma once
 
-#include <cstddef>
 #include <optional>
 
 #include "property_lists/property_list_value.h"
@@ -27,9 +26,6 @@ class KELRestrictionListEntry {
   const platform::PropertyListString& title() const { return title_; }
 
   bool operator==(const KELRestrictionListEntry&) const = default;
-
-  /// The hash of the title alone.
-  std::size_t hash() const;
 
  private:
   KELRestrictionListEntry(platform::PropertyListString bundleID, platform::PropertyListString title);

@@ -18,8 +18,8 @@ using platform::PropertyListDictionaryBuilder;
 using platform::PropertyListString;
 using platform::PropertyListValue;
 
-/// A set of entries. Hashed by title like the entries themselves; the identifiers under one title are
-/// ordered, so that a list with many rows of one title costs no more than another.
+/// A set of entries, hashed by title. The identifiers under one title are ordered, so that a list with many
+/// rows of one title costs no more than another.
 class EntrySet {
  public:
   explicit EntrySet(const std::vector<KELRestrictionListEntry>& entries) {
@@ -34,21 +34,15 @@ class EntrySet {
   }
 
  private:
+  // Views into the entries, which outlive the set.
   std::unordered_map<std::string_view, std::set<std::string_view>> identifiers_;
 };
 
 constexpr std::string_view unrestrictedKey = "QVUnrestricted";
 constexpr std::string_view restrictedKey = "QVRestricted";
 
-PropertyListArray arrayUnder(const PropertyListDictionary& dictionary, std::string_view key) {
-  const PropertyListValue* value = dictionary.find(key);
-  const PropertyListArray* array = value ? value->asArray() : nullptr;
-  return array ? *array : PropertyListArray();
-}
-
-std::optional<PropertyListString> sharedString(const PropertyListValue* value) {
-  const PropertyListString* string = value ? value->asSharedString() : nullptr;
-  return string ? std::optional(*string) : std::nullopt;
+PropertyListArray rowsUnder(const PropertyListDictionary& plist, std::string_view key) {
+  return copied(array_value(plist, key)).value_or(PropertyListArray());
 }
 
 }  // namespace
@@ -57,16 +51,16 @@ std::optional<PropertyListDictionary> load_restrictions_file(platform::FileSyste
                                                              platform::StandardDirectories& directories) {
   const std::vector<std::string> libraries = directories.systemLibraryDirectories();
   if (libraries.empty()) return std::nullopt;
-  const std::string path = platform::joinPath(platform::joinPath(libraries.back(), "CoreAgents"),
-                                              "com.orvex.QVServicesRestrictions.plist");
+  const std::string path =
+      platform::joinPath(platform::joinPath(libraries.back(), "CoreAgents"), restrictionsFileName);
   return platform::readDictionaryFile(files, path, platform::largestForeignFile).dictionary;
 }
 
 std::shared_ptr<const KELRestrictionLists> restriction_lists_from_plist(
     const std::optional<PropertyListDictionary>& plist) {
   if (!plist) return nullptr;
-  const RestrictionListsOf<PropertyListValue> rows{arrayUnder(*plist, unrestrictedKey),
-                                                   arrayUnder(*plist, restrictedKey)};
+  const RestrictionListsOf<PropertyListValue> rows{rowsUnder(*plist, unrestrictedKey),
+                                                   rowsUnder(*plist, restrictedKey)};
   return std::make_shared<const KELRestrictionLists>(
       transform_restriction_lists(rows, &KELRestrictionListEntry::initWithDictionaryRepresentation));
 }
@@ -86,6 +80,7 @@ void apply_restriction_lists(std::vector<PropertyListDictionaryBuilder>& service
   const EntrySet unrestricted((lists ? *lists : none).unrestricted);
   const EntrySet restricted((lists ? *lists : none).restricted);
   for (PropertyListDictionaryBuilder& service : services) {
+    // What the bundle declares holds, even when it is false.
     if (service.find(service_keys::QVRestricted)) continue;
     const std::optional<KELRestrictionListEntry> entry = restriction_entry_for_service(service);
     if (!entry) continue;
@@ -96,19 +91,17 @@ void apply_restriction_lists(std::vector<PropertyListDictionaryBuilder>& service
 }
 
 bool is_vendor_service(const ServiceView& service) {
-  const PropertyListValue* identifier = service.find(service_keys::QVBundleIdentifier);
-  const std::string* text = identifier ? identifier->asString() : nullptr;
-  return text && text->starts_with("com.orvex.");
+  const std::string* identifier = string_value(service, service_keys::QVBundleIdentifier);
+  return identifier && identifier->starts_with("com.orvex.");
 }
 
 std::optional<KELRestrictionListEntry> restriction_entry_for_service(const ServiceView& service) {
-  const PropertyListValue* menuItem = service.find(service_keys::QVMenuItem);
-  const PropertyListDictionary* titles = menuItem ? menuItem->asDictionary() : nullptr;
+  const PropertyListDictionary* titles = dictionary_value(service, service_keys::QVMenuItem);
   if (!titles) return std::nullopt;
-  std::optional<PropertyListString> title = sharedString(titles->find(service_keys::defaultTitle.text()));
-  if (!title) title = sharedString(titles->find("English"));
+  const PropertyListString* title = shared_string_value(*titles, service_keys::defaultTitle);
+  if (!title) title = shared_string_value(*titles, "English");
   return KELRestrictionListEntry::initWithBundleID(
-      sharedString(service.find(service_keys::QVBundleIdentifier)), std::move(title));
+      copied(shared_string_value(service, service_keys::QVBundleIdentifier)), copied(title));
 }
 
 }  // namespace kel

@@ -2,6 +2,7 @@
 
 #include <memory>
 #include <optional>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -31,8 +32,8 @@ class ServiceView {
   ServiceView(const platform::PropertyListDictionaryBuilder& service) : building_(&service) {}
 
   /// The value under `key`, or null.
-  const platform::PropertyListValue* find(const platform::PropertyListString& key) const {
-    return finished_ ? finished_->find(key.text()) : building_->find(key);
+  const platform::PropertyListValue* find(std::string_view key) const {
+    return finished_ ? finished_->find(key) : building_->find(key);
   }
 
  private:
@@ -40,8 +41,11 @@ class ServiceView {
   const platform::PropertyListDictionaryBuilder* building_ = nullptr;
 };
 
-/// Reads the restrictions file, "CoreAgents/com.orvex.QVServicesRestrictions.plist" in the system's library
-/// directory, anew. None when there is no such file or it is no property list with a dictionary at its top.
+/// What the restrictions file is called, where it holds and where it is generated.
+inline constexpr const char* restrictionsFileName = "com.orvex.QVServicesRestrictions.plist";
+
+/// Reads the restrictions file, in "CoreAgents" of the system's library directory, anew. None when there is
+/// no such file or it is no property list with a dictionary at its top.
 std::optional<platform::PropertyListDictionary> load_restrictions_file(
     platform::FileSystem& files, platform::StandardDirectories& directories);
 

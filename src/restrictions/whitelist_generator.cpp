@@ -12,6 +12,7 @@ namespace kel {
 
 namespace {
 
+using platform::PropertyListArray;
 using platform::PropertyListDictionary;
 using platform::PropertyListString;
 using platform::PropertyListValue;
@@ -20,9 +21,9 @@ using Entries = std::vector<KELRestrictionListEntry>;
 
 Entries vendorServicesOf(const PropertyListValue& publication) {
   const PropertyListDictionary* dictionary = publication.asDictionary();
-  const PropertyListValue* services = dictionary ? dictionary->find("KTVendedServices") : nullptr;
-  if (!services || !services->asArray()) return {};
-  return map_array(*services->asArray(), [](const PropertyListValue& value) {
+  const PropertyListArray* services = dictionary ? array_value(*dictionary, platform::publishedListKey) : nullptr;
+  if (!services) return {};
+  return map_array(*services, [](const PropertyListValue& value) {
     const PropertyListDictionary* service = value.asDictionary();
     return service && is_vendor_service(*service) ? restriction_entry_for_service(*service) : std::nullopt;
   });
@@ -32,6 +33,7 @@ void removeBlacklisted(Entries& entries, platform::SystemLog& log) {
   for (const auto& [bundleID, title] : default_blacklist) {
     const auto row =
         KELRestrictionListEntry::initWithBundleID(PropertyListString(bundleID), PropertyListString(title));
+    // A row that names nothing may be a service that was renamed and now slips through.
     if (std::erase(entries, *row) > 0) continue;
     log.write("Blacklisted Service '" + std::string(bundleID) + ":" + std::string(title) +
               "' not found. Perhaps the blacklist needs to be updated?");
@@ -39,7 +41,7 @@ void removeBlacklisted(Entries& entries, platform::SystemLog& log) {
 }
 
 void writeRestrictionsFile(platform::Platform& platform, platform::BytesView bytes, std::ostream& out) {
-  const std::string name = "com.orvex.QVServicesRestrictions.plist";
+  const std::string name = restrictionsFileName;
   const std::optional<std::string> directory = platform.directories.temporaryDirectory();
   const std::string path = directory ? platform::joinPath(*directory, name) : name;
   const std::optional<std::string> error =
@@ -56,9 +58,10 @@ void writeRestrictionsFile(platform::Platform& platform, platform::BytesView byt
 void generate_whitelist(platform::Platform& platform, std::ostream& out) {
   if (running_from_launcher(platform.facts)) return;
   const std::optional<PropertyListValue> publication =
-      platform.preferences.value("com.orvex.ServicesMenu.Services", "QVServices");
+      platform.preferences.value(platform::publicationDomain, platform::publicationKey);
   if (!publication) {
-    out << "No services (com.orvex.ServicesMenu.Services missing or empty in QVServices preferences)\n";
+    out << "No services (" << platform::publicationDomain << " missing or empty in "
+        << platform::publicationKey << " preferences)\n";
     return;
   }
   KELRestrictionLists lists{vendorServicesOf(*publication), {}};

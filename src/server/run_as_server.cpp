@@ -51,9 +51,10 @@ void subscribeToLaunchEvents(platform::Platform& platform, KELServer& server) {
   const auto subscribe = [&](const char* stream, void (KELServer::*react)()) {
     platform.launchEvents.setHandler(stream, server.conduitQueue(), [&server, react] { (server.*react)(); });
   };
-  subscribe("com.orvex.beacond.matching", &KELServer::reactToAppRegistryDatabaseChange);
-  subscribe("com.orvex.broadcastd.matching", &KELServer::reactToAppRegistrySeedingComplete);
-  subscribe("com.orvex.vigil.matching", &KELServer::reactToVigilChange);
+  namespace streams = platform::launch_streams;
+  subscribe(streams::databaseChanges, &KELServer::reactToAppRegistryDatabaseChange);
+  subscribe(streams::seedingComplete, &KELServer::reactToAppRegistrySeedingComplete);
+  subscribe(streams::directoryChanges, &KELServer::reactToVigilChange);
 }
 
 }  // namespace

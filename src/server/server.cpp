@@ -71,7 +71,7 @@ void KELServer::schmutzItUpForKT(const PropertyListValue& publicDictionaries) {
   publication.set("KTVersion", 2);
   publication.set("KTPrincipalLocalizations",
                   PropertyListArray(localizations->begin(), localizations->end()));
-  publication.set("KTVendedServices", publicDictionaries);
+  publication.set(platform::publishedListKey, publicDictionaries);
   const auto& queue = publicationQueue_.get(
       [] { return std::make_unique<platform::SerialQueue>("KEL KTServiceController"); });
   queue->async([this, publication = PropertyListValue(publication.build()),

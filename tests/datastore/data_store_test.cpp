@@ -2,6 +2,7 @@
 
 #include <regex>
 
+#include "datastore/boot_session.h"
 #include "support/debug_lines.h"
 #include "support/in_memory_platform.h"
 #include "support/property_lists.h"
@@ -278,20 +279,6 @@ TEST_F(DataStoreTest, RestrictionsAreReadAgainOnlyWhenTold) {
   system.files.removeTree(restrictionsPath);
   update(KELStaleRestrictionLists);
   EXPECT_FALSE(isRestricted()) << "a missing file took the lists away";
-}
-
-TEST(PathsToObserveTest, ThreeNeighboursAreWatchedThroughTheirDirectoryAndNothingTwice) {
-  for (const auto& [paths, expected] : std::vector<std::pair<Names, Names>>{
-           {{}, {}},
-           {{"/A/x.app", "/A/x.app/in.app"}, {"/A/x.app", "/A/x.app/in.app"}},
-           {{"/A/x.app", "/A/y.app", "/A/z.app", "/A/B/w.app"}, {"/A/"}},
-           {{"/x", "/y", "/z", "/A/w.app"}, {"/"}}}) {
-    EXPECT_THAT(paths_to_observe(paths), testing::UnorderedElementsAreArray(expected));
-  }
-  for (const auto& [path, parent] : std::vector<std::pair<std::string, std::string>>{
-           {"/A/x.app", "/A/"}, {"/A/", "/"}, {"/A/B/", "/A/"}, {"/", "/"}, {"x", "/"}, {"", "/"}}) {
-    EXPECT_EQ(parent_directory(path), parent) << path;
-  }
 }
 
 }  // namespace

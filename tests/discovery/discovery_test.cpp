@@ -1,6 +1,7 @@
 #include <gmock/gmock.h>
 #include <thread>
 
+#include "discovery/bundle_paths.h"
 #include "discovery/path_change_observation_request.h"
 #include "discovery/path_changes_observer.h"
 #include "discovery/services_provider_locator.h"
@@ -36,6 +37,20 @@ TEST(ServicesProviderLocatorTest, ListsOnceKeepsVisibleEntriesOfEveryKindAndMiss
   EXPECT_EQ(debugLines([&] { missing.refreshCache(); }), "Scanning directory: /none/");
   EXPECT_THAT(missing.paths(), IsEmpty());
   EXPECT_TRUE(missing.directoryContentsCacheIsValid());
+}
+
+TEST(PathsToObserveTest, ThreeNeighboursAreWatchedThroughTheirDirectoryAndNothingTwice) {
+  for (const auto& [paths, expected] : std::vector<std::pair<Paths, Paths>>{
+           {{}, {}},
+           {{"/A/x.app", "/A/x.app/in.app"}, {"/A/x.app", "/A/x.app/in.app"}},
+           {{"/A/x.app", "/A/y.app", "/A/z.app", "/A/B/w.app"}, {"/A/"}},
+           {{"/x", "/y", "/z", "/A/w.app"}, {"/"}}}) {
+    EXPECT_THAT(paths_to_observe(paths), testing::UnorderedElementsAreArray(expected));
+  }
+  for (const auto& [path, parent] : std::vector<std::pair<std::string, std::string>>{
+           {"/A/x.app", "/A/"}, {"/A/", "/"}, {"/A/B/", "/A/"}, {"/", "/"}, {"x", "/"}, {"", "/"}}) {
+    EXPECT_EQ(parent_directory(path), parent) << path;
+  }
 }
 
 class PathChangesObserverTest : public testing::Test {

@@ -170,10 +170,15 @@ TEST(BinaryPropertyListTest, SharingThatMultipliesIsRefusedBeforeItCostsTime) {
   // 100,000 objects that all lie at one place: a string of a megabyte, or an array of 100,000 elements.
   constexpr std::size_t count = 100'000;
   std::string top = "\xAF\x12" + number(count, 4), array = top;
-  for (std::size_t i = 0; i < count; ++i) top += number(2 + i, 3), array += number(1, 3);
+  for (std::size_t i = 0; i < count; ++i) {
+    top += number(2 + i, 3);
+    array += number(1, 3);
+  }
   for (const std::string& object : {"\x5F\x12\0\x10\0\0"s + std::string(1 << 20, 'x'), array}) {
     std::vector<std::string> objects(2 + count);
-    objects[0] = top, objects[1] = "\x08", objects.back() = object;
+    objects[0] = top;
+    objects[1] = "\x08";
+    objects.back() = object;
     EXPECT_THAT(read(file(objects, 4, 3)).error, HasSubstr("the value expands to more than"));
   }
 }

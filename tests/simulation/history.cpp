@@ -13,8 +13,8 @@ using namespace std::chrono_literals;
 namespace {
 
 const std::string seedName = "user.uid.501.com.orvex.qvservices.seed";
-constexpr const char* registryStream = "com.orvex.beacond.matching";
-constexpr const char* directoryStream = "com.orvex.vigil.matching";
+constexpr const char* registryStream = platform::launch_streams::databaseChanges;
+constexpr const char* directoryStream = platform::launch_streams::directoryChanges;
 
 /// The main thread of a server; it has what dies with it.
 struct ServerProcess : platform::Process {

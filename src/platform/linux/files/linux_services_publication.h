@@ -9,9 +9,8 @@
 
 namespace kel::platform {
 
-/// Publishes the services in the preferences domain "com.orvex.ServicesMenu.Services", under "QVServices";
-/// the domain's other keys stay. Readers see the old file or the new. One call at a time. Borrows `files` and
-/// `log`, which outlive it.
+/// Publishes the services in their preferences domain, whose other keys stay. Readers see the old file or the
+/// new. One call at a time. Borrows `files` and `log`, which outlive it.
 class LinuxServicesPublication final : public ServicesPublication {
  public:
   LinuxServicesPublication(FileSystem& files, SystemLog& log, std::optional<std::string> stateDirectory)

@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "platform/application_registry.h"
+#include "platform/bundles.h"
 #include "platform/file_system.h"
 #include "platform/linux/journal/entry_look.h"
 
@@ -23,9 +24,9 @@ InformationStatus informationStatus(const std::string& application) {
 std::uint32_t informationFlags(BytesView contents) {
   const PropertyListReading reading = readPropertyList(contents, bundleFileLimits);
   const PropertyListDictionary* dictionary = reading.value ? reading.value->asDictionary() : nullptr;
-  const PropertyListValue* services = dictionary ? dictionary->find("QVServices") : nullptr;
-  const PropertyListArray* array = services ? services->asArray() : nullptr;
-  return array && !array->empty() ? ApplicationRegistry::providesServices : 0;
+  const PropertyListArray* services =
+      dictionary ? array_value(*dictionary, information_keys::services) : nullptr;
+  return services && !services->empty() ? ApplicationRegistry::providesServices : 0;
 }
 
 std::string informationPath(const std::string& application) { return joinPath(application, "Info.plist"); }

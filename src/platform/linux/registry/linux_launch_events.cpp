@@ -8,8 +8,6 @@ namespace kel::platform {
 
 namespace {
 
-constexpr const char* databaseChange = "com.orvex.AppRegistry.DatabaseChange";
-
 /// Posts the registry's notification, once a second at most however much changes. Used on one queue.
 class DatabaseChangePoster : public std::enable_shared_from_this<DatabaseChangePoster> {
  public:
@@ -24,7 +22,7 @@ class DatabaseChangePoster : public std::enable_shared_from_this<DatabaseChangeP
       self->queue_.assertCurrent();
       self->isPending_ = false;
       self->last_ = std::chrono::steady_clock::now();
-      self->seeds_.post(databaseChange);
+      self->seeds_.post(databaseChangeNotification);
     });
   }
 
@@ -51,15 +49,15 @@ LinuxLaunchEvents::~LinuxLaunchEvents() {
 
 void LinuxLaunchEvents::setHandler(std::string_view stream, SerialQueue& queue,
                                    std::function<void()> handler) {
-  if (stream == "com.orvex.beacond.matching") {
-    sources_.push_back({queue, seeds_.observe(databaseChange, queue, handler)});
-  } else if (stream == "com.orvex.broadcastd.matching") {
+  if (stream == launch_streams::databaseChanges) {
+    sources_.push_back({queue, seeds_.observe(databaseChangeNotification, queue, handler)});
+  } else if (stream == launch_streams::seedingComplete) {
     // Whoever started the server waits for a first answer, which needs the processors more.
     constexpr std::chrono::seconds pause{1};
     queue.after(pause, [&applications = applications_, &queue, handler] {
       applications.seed([&queue, handler] { queue.async(handler); });
     });
-  } else if (stream == "com.orvex.vigil.matching") {
+  } else if (stream == launch_streams::directoryChanges) {
     watch(queue, handler);
   } else {
     return log_.write("There is no launch-event stream " + std::string(stream));

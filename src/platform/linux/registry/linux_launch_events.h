@@ -13,10 +13,10 @@
 namespace kel::platform {
 
 /// The event streams, from this machine's own sources:
-/// - "com.orvex.beacond.matching": posts of "com.orvex.AppRegistry.DatabaseChange", which changes below the
-///   application directories lead to;
-/// - "com.orvex.broadcastd.matching": the end of the application registry's first scan;
-/// - "com.orvex.vigil.matching": changes below the directories that the journal watches.
+/// - `databaseChanges`: posts of the database's notification, which changes below the application directories
+///   lead to;
+/// - `seedingComplete`: the end of the application registry's first scan;
+/// - `directoryChanges`: changes below the directories that the journal watches.
 ///
 /// The event at the start is queued when a handler is set, so it comes before everything queued later. The
 /// registry's scan and the watching begin with the handlers of their streams. Made and used on the main

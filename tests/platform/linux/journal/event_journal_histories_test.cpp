@@ -165,7 +165,10 @@ class Disk {
     move(outside_ + "new", anyBundle() + "/Info.plist");
   }
   void removeFile() { unlink(anyFile().c_str()); }
-  void changeMode() { chmod(anyFile().c_str(), below(2) ? 0600 : 0644), touchLinks(); }
+  void changeMode() {
+    chmod(anyFile().c_str(), below(2) ? 0600 : 0644);
+    touchLinks();
+  }
   void retarget() {
     const std::string path = root + "linked.service";
     touched.insert(path);
@@ -183,7 +186,8 @@ class Disk {
   }
   void setOldTimes() {
     const timespec times[2] = {{1'000'000'000, 0}, {1'000'000'000, 0}};
-    utimensat(AT_FDCWD, anyFile().c_str(), times, 0), touchLinks();
+    utimensat(AT_FDCWD, anyFile().c_str(), times, 0);
+    touchLinks();
   }
   void addBundle() {
     const std::string bundle = root + bundleName(below(6));
@@ -236,7 +240,6 @@ class Server {
     journal_->start([](JournalForest::Hints) {});
   }
   void stop() { journal_.reset(); }
-  void restart() { stop(), start(); }
 
   /// Loses what was written last, as a process does that is killed before it writes.
   void kill() {
@@ -322,24 +325,20 @@ void runHistory(unsigned seed, bool live, Tally& tally) {
     bool killed = false;
     for (unsigned left = disk.below(7); left > 0; --left, ++tally.operations) {
       disk.operate();
-      switch (disk.below(24)) {
-        case 0:
-          server.restart();
-          break;
-        case 1:
-          server.stop(), server.clockStep -= 3'600'000'000'000, disk.operate(), server.start();
-          break;
-        case 2:
-          server.stop(), server.clockStep += 60'000'000'000, server.start();
-          break;
-        case 3:
-          killed = true, server.kill();
-          break;
-        case 4:
-          disk.replaceRoot();
-          break;
-        default:
-          break;
+      const unsigned happens = disk.below(24);
+      if (happens < 3) {
+        server.stop();
+        if (happens == 1) {
+          server.clockStep -= 3'600'000'000'000;
+          disk.operate();
+        }
+        if (happens == 2) server.clockStep += 60'000'000'000;
+        server.start();
+      } else if (happens == 3) {
+        killed = true;
+        server.kill();
+      } else if (happens == 4) {
+        disk.replaceRoot();
       }
     }
     auto now = disk.snapshot();

@@ -46,7 +46,10 @@ TEST_F(JournalKeeperTest, WhatWasLookedAtWhileTheRootWasAnotherIsNotTakenForTheR
     open();
     {
       const std::jthread exchanging([this](const std::stop_token& stop) {
-        while (!stop.stop_requested()) exchange(), exchange();
+        while (!stop.stop_requested()) {
+          exchange();
+          exchange();
+        }
       });
       keeper->currentEventID();
     }

@@ -55,7 +55,10 @@ class EventJournalTest : public ScratchTest, public testing::WithParamInterface<
     stream->setQueue(queue);
     EXPECT_TRUE(stream->start());
     EXPECT_EQ(done.get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
-    queue.sync([&] { stream->stop(), stream->invalidate(); });
+    queue.sync([&] {
+      stream->stop();
+      stream->invalidate();
+    });
     return told;
   }
 
@@ -184,14 +187,18 @@ TEST_P(LiveEventJournalTest, AnOverflowOfTheEventQueueIsMadeUpFor) {
   std::promise<void> entered, released;
   std::atomic<bool> isFirst = true;
   changed = [&](JournalForest::Hints) {
-    if (isFirst.exchange(false)) entered.set_value(), released.get_future().wait();
+    if (!isFirst.exchange(false)) return;
+    entered.set_value();
+    released.get_future().wait();
   };
   bundle("a.service");
   const EventID start = journal().currentEventID();
   bundle("b.service");
   entered.get_future().wait();  // the journal's thread is held here
-  for (int index = 0; index < 20'000; ++index)
-    fs::rename(root + "a.service", root + "c.service"), fs::rename(root + "c.service", root + "a.service");
+  for (int index = 0; index < 20'000; ++index) {
+    fs::rename(root + "a.service", root + "c.service");
+    fs::rename(root + "c.service", root + "a.service");
+  }
   scratch.write("Services/a.service/Info.plist", "DECLARED");
   bundle("d.service");
   released.set_value();
@@ -222,7 +229,10 @@ TEST_P(LiveEventJournalTest, AStreamGoesOnWithWhatHappensUntilItIsStopped) {
   bundle("b.service");
   ASSERT_TRUE(news.wait(std::chrono::seconds(30)));
   EXPECT_THAT(told.copy(), Contains(root + "b.service/"));
-  queue.sync([&] { stream->stop(), stream->invalidate(); });
+  queue.sync([&] {
+    stream->stop();
+    stream->invalidate();
+  });
   told.set({});
   bundle("c.service");
   EXPECT_THAT(replay(start), Contains("c.service/"));  // the journal has seen it by now

@@ -105,7 +105,10 @@ TEST_F(LinuxApplicationRegistryTest, QueryDuringSeedingWaitsForItsScan) {
   std::thread query;
   const auto registry = makeRegistry(&changes);
   counted.onFirstRead = [&] { query = std::thread([&] { registry->applications(0, 0); }); };
-  registry->seed([&] { registry->applications(0, 0), done.signal(); });
+  registry->seed([&] {
+    registry->applications(0, 0);
+    done.signal();
+  });
   ASSERT_TRUE(done.wait(std::chrono::seconds(20)));
   query.join();
   EXPECT_EQ(counted.reads, 1);
