@@ -1,11 +1,14 @@
 #include <span>
 
 #include "platform/linux/files/linux_bundles.h"
+#include "platform/linux/files/linux_preferences.h"
+#include "platform/linux/files/linux_services_publication.h"
+#include "platform/linux/registry/linux_application_registry.h"
 #include "platform/linux/scratch.h"
 #include "support/in_memory_platform.h"
 #include "support/property_lists.h"
 
-// What the seams over files promise: files and bundles.
+// What the seams over files promise: files, bundles, preferences and the published list, applications.
 namespace kel::platform {
 namespace {
 
@@ -15,15 +18,28 @@ using testing::Optional;
 using testing::UnorderedElementsAre;
 
 struct InMemoryWorld : InMemoryPlatform {
+  void install(const std::string& name, bool withServices) {
+    (withServices ? registry.registered : registry.plain).push_back({root + name});
+  }
+
+  Preferences& preferences = publication;
   const std::string root = "/tmp/u/";
 };
 
 struct LinuxWorld {
+  void install(const std::string& name, bool withServices) const {
+    scratch.write(name + "/Info.plist", withServices ? "{ QVServices = ({}); }" : "{ QVServices = (); }");
+  }
+
   Scratch scratch;
   const std::string root = scratch / "";
   RecordingLog log;
+  ConcurrentQueue queue;
   LinuxFileSystem files{log};
   LinuxBundles bundles{files, log};
+  LinuxServicesPublication publication{files, log, root};
+  LinuxPreferences preferences{files, root, std::nullopt};
+  LinuxApplicationRegistry registry{files, log, queue, {root}, std::nullopt, nullptr};
 };
 
 /// The services of one world, and files in a directory of the test's own.
@@ -109,6 +125,32 @@ TYPED_TEST(FilesContract, ResourceIsAFileOfALocalizationThatHasAProperName) {
   for (const std::string& name : good)
     EXPECT_EQ(bundle->resourcePath("r", "t", name), this->root + "a/Resources/" + name + "/r.t");
   for (const std::string& name : bad) EXPECT_FALSE(bundle->resourcePath("r", "t", name)) << name;
+}
+
+TYPED_TEST(FilesContract, PublishedListIsReadAnewUnderItsDomainAndKeyOnly) {
+  const std::string domain = "com.orvex.ServicesMenu.Services";
+  const auto read = [&](auto... where) { return this->world.preferences.value(where...); };
+  EXPECT_FALSE(read(domain, "QVServices"));
+  for (const PropertyListValue& list : {PropertyListValue(Array{"a", 1}), PropertyListValue("b")}) {
+    this->world.publication.publish(list);
+    EXPECT_EQ(read(domain, "QVServices"), list);
+  }
+  EXPECT_FALSE(read(domain, "Other") || read("com.orvex.Other", "QVServices") || read("", "QVServices"));
+  EXPECT_FALSE(read("../preferences/" + domain, "QVServices"));
+}
+
+TYPED_TEST(FilesContract, ApplicationsAreChosenByTheirFlagsUnderTheMask) {
+  for (const char* name : {"A.app", "B.app", "Plain.app"}) this->world.install(name, name != "Plain.app"s);
+  constexpr std::uint32_t services = ApplicationRegistry::providesServices;
+  const auto found = [&](std::uint32_t mask, std::uint32_t value) {
+    std::string initials;
+    for (const auto& each : this->world.registry.applications(mask, value))
+      initials += each.path->at(this->root.size());
+    return initials;
+  };
+  EXPECT_EQ(found(services, services) + found(~0U, services), "ABAB");
+  EXPECT_EQ(found(0, 0) + found(~services, 0) + found(services, 0), "ABPABPP");
+  EXPECT_EQ(found(0, services) + found(~0U, services | 1), "");
 }
 
 }  // namespace

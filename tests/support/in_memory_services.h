@@ -121,16 +121,19 @@ class InMemoryLaunchEvents : public platform::LaunchEvents {
   std::map<std::string, std::function<void()>> fire;  ///< queues the stream's handler
 };
 
-/// Applications that provide services.
+/// Applications that a test installs: those with services come first.
 class InMemoryRegistry : public platform::ApplicationRegistry {
  public:
   std::vector<platform::RegisteredApplication> applications(std::uint32_t mask,
                                                             std::uint32_t value) override {
     ++queries;
-    return mask & value & providesServices ? registered : std::vector<platform::RegisteredApplication>();
+    auto result = (providesServices & mask) == value ? registered : decltype(registered)();
+    if (value == 0) result.insert(result.end(), plain.begin(), plain.end());
+    return result;
   }
 
-  std::vector<platform::RegisteredApplication> registered;
+  std::vector<platform::RegisteredApplication> registered;  ///< that provide services
+  std::vector<platform::RegisteredApplication> plain;       ///< that set no flag
   std::atomic<std::size_t> queries = 0;
 };
 
