@@ -30,7 +30,7 @@ class InMemoryBundle : public platform::Bundle {
                                           std::string_view localization) override {
     const auto resource = platform::localizedResourceName(name, type, localization);
     const std::string path = platform::joinPath(path_, resource.value_or(""));
-    return resource && files_.exists(path) ? std::optional(path) : std::nullopt;
+    return resource && files_.exists(path) && files_.isFile(path) ? std::optional(path) : std::nullopt;
   }
 
  private:

@@ -14,8 +14,8 @@
 
 namespace kel::test {
 
-/// A tree of files and directories in memory. Adding a file makes the directories above it; a trailing "/" of
-/// a path does not count. Any thread.
+/// A tree of files and directories in memory, with the user's temporary directory from the start. Adding a
+/// file makes the directories above it; a trailing "/" of a path does not count. Any thread.
 class InMemoryFileSystem : public platform::FileSystem {
  public:
   std::optional<std::vector<std::string>> listDirectory(const std::string& directory) override {
@@ -45,14 +45,10 @@ class InMemoryFileSystem : public platform::FileSystem {
     });
   }
   std::optional<std::string> writeAtomically(const std::string& path, platform::BytesView bytes) override {
-    return state_.with([&](State& state) {
-      state.use(path);
-      if (!state.nextWriteError) state.put(path, platform::Bytes(bytes.begin(), bytes.end()));
-      return std::exchange(state.nextWriteError, std::nullopt);
-    });
+    return state_.with([&](State& state) { return state.write(path, bytes, true); });
   }
   std::optional<std::string> writePlainly(const std::string& path, platform::BytesView bytes) override {
-    return writeAtomically(path, bytes);
+    return state_.with([&](State& state) { return state.write(path, bytes, false); });
   }
   bool remove(const std::string& path) override {
     return state_.with([&](State& state) {
@@ -63,7 +59,9 @@ class InMemoryFileSystem : public platform::FileSystem {
 
   // Arranging the tree and looking at it; none of these counts as a use.
   void addFile(const std::string& path, platform::Bytes bytes) {
-    state_.with([&](State& state) { state.put(path, std::move(bytes)); });
+    state_.with([&](State& state) {
+      if (const auto error = state.put(path, std::move(bytes), true)) throw std::logic_error(path + *error);
+    });
   }
   void addText(const std::string& path, std::string_view text) {
     addFile(path, platform::Bytes(text.begin(), text.end()));
@@ -103,7 +101,7 @@ class InMemoryFileSystem : public platform::FileSystem {
   using Node = std::optional<platform::Bytes>;  ///< absent for a directory
 
   struct State {
-    std::map<std::string, Node> nodes;  ///< by normalised path
+    std::map<std::string, Node> nodes{{"/tmp", {}}, {"/tmp/u", {}}};  ///< by normalised path
     std::map<std::string, std::size_t> uses;
     std::optional<std::string> nextWriteError;
 
@@ -115,12 +113,21 @@ class InMemoryFileSystem : public platform::FileSystem {
       ++uses[normalised(path)];
       return find(path);
     }
-    void put(const std::string& path, Node node) {
-      const std::string own = normalised(path);
-      for (auto slash = own.find('/', 1); slash != std::string::npos; slash = own.find('/', slash + 1)) {
-        if (nodes[own.substr(0, slash)]) throw std::logic_error("a file is in the way of " + path);
+    std::optional<std::string> write(const std::string& path, platform::BytesView bytes, bool makesParents) {
+      use(path);
+      if (nextWriteError) return std::exchange(nextWriteError, std::nullopt);
+      return put(path, platform::Bytes(bytes.begin(), bytes.end()), makesParents);
+    }
+    std::optional<std::string> put(const std::string& path, Node node, bool makesParents) {
+      const std::string own = normalised(path), parent = own.substr(0, own.rfind('/'));
+      if (find(own) && !*find(own)) return "Is a directory";
+      if (find(parent) && *find(parent)) return "Not a directory";
+      if (!find(parent) && !parent.empty()) {
+        if (!makesParents) return "No such file or directory";
+        if (const auto error = put(parent, std::nullopt, true)) return error;
       }
       nodes[own] = std::move(node);
+      return std::nullopt;
     }
   };
 

@@ -76,7 +76,7 @@ class CountingTransactions : public platform::Transactions {
   std::atomic<int> openCount = 0;
 };
 
-/// Seeds in memory; posts are counted and reach nobody. Any thread.
+/// Seeds in memory; posts are counted, too. Any thread; no queue that observes ends during a post.
 class InMemorySeeds : public platform::NotificationSeeds {
  public:
   Token registerName(const std::string& name) override {
@@ -89,11 +89,19 @@ class InMemorySeeds : public platform::NotificationSeeds {
     seeds_.with([&](auto& seeds) { seeds[token].state = state; });
   }
   void post(const std::string& name) override {
-    seeds_.with([&](auto& seeds) { ++seeds[registerName(name)].posts; });
+    seeds_.with([&](auto& seeds) {
+      Seed& seed = seeds[registerName(name)];
+      ++seed.posts;
+      for (const auto& [queue, observer] : seed.observers) {
+        if (!observer.expired()) queue->async([observer = observer] { call(observer.lock()); });
+      }
+    });
   }
-  std::unique_ptr<Observation> observe(const std::string&, platform::SerialQueue&,
-                                       std::function<void()>) override {
-    return nullptr;
+  std::unique_ptr<Observation> observe(const std::string& name, platform::SerialQueue& queue,
+                                       std::function<void()> posted) override {
+    auto observer = std::make_shared<const Observer>(std::move(posted));
+    seeds_.with([&](auto& seeds) { seeds[registerName(name)].observers.emplace_back(&queue, observer); });
+    return std::make_unique<Watch>(std::move(observer));
   }
 
   std::size_t postsOf(const std::string& name) {
@@ -101,10 +109,20 @@ class InMemorySeeds : public platform::NotificationSeeds {
   }
 
  private:
+  using Observer = std::function<void()>;
+  struct Watch : Observation {
+    explicit Watch(std::shared_ptr<const Observer> watching) : observer(std::move(watching)) {}
+    const std::shared_ptr<const Observer> observer;
+  };
   struct Seed {
     std::uint64_t state = 0;
     std::size_t posts = 0;
+    std::vector<std::pair<platform::SerialQueue*, std::weak_ptr<const Observer>>> observers;
   };
+  static void call(const std::shared_ptr<const Observer>& observer) {
+    if (observer) (*observer)();
+  }
+
   platform::Guarded<std::map<Token, Seed>> seeds_;
 };
 
@@ -121,16 +139,19 @@ class InMemoryLaunchEvents : public platform::LaunchEvents {
   std::map<std::string, std::function<void()>> fire;  ///< queues the stream's handler
 };
 
-/// Applications that provide services.
+/// Applications that a test installs: those with services come first.
 class InMemoryRegistry : public platform::ApplicationRegistry {
  public:
   std::vector<platform::RegisteredApplication> applications(std::uint32_t mask,
                                                             std::uint32_t value) override {
     ++queries;
-    return mask & value & providesServices ? registered : std::vector<platform::RegisteredApplication>();
+    auto result = (providesServices & mask) == value ? registered : decltype(registered)();
+    if (value == 0) result.insert(result.end(), plain.begin(), plain.end());
+    return result;
   }
 
-  std::vector<platform::RegisteredApplication> registered;
+  std::vector<platform::RegisteredApplication> registered;  ///< that provide services
+  std::vector<platform::RegisteredApplication> plain;       ///< that set no flag
   std::atomic<std::size_t> queries = 0;
 };
 
