@@ -51,6 +51,10 @@ class KELDataStore {
   /// May block for as long as reading every bundle takes.
   void updateServicesCache(KELStaleCacheFlags flags);
 
+  /// What an update must look at again because it could not be read for the moment; absent when there is
+  /// nothing. 0 is not nothing: single bundles, which every update looks at again.
+  std::optional<KELStaleCacheFlags> unsettledSources() const;
+
   /// Writes the cache file in the background, as the store stands now.
   void writeCaches();
 
@@ -106,6 +110,8 @@ class KELDataStore {
   platform::SerialQueue writeQueue_{"Datastore Write Queue", queue_depths::datastoreWrites};
   platform::EventID eventStreamID_ = 0;
   bool cacheIsLoaded_ = false;
+  bool registryIsUnsettled_ = false;
+  bool restrictionsAreUnsettled_ = false;
 };
 
 }  // namespace kel

@@ -101,8 +101,8 @@ void KELDataStore::loadCache() {
   cacheSessionID_ = platform::copied(string_value(cache, sessionIDKey));
 
   const PropertyListDictionary* lists = dictionary_value(cache, restrictionListsKey);
-  restrictionLists_ = restriction_lists_from_plist(
-      lists ? std::optional(*lists) : load_restrictions_file(platform_.files, platform_.directories));
+  restrictionLists_ = restriction_lists_from_plist(lists ? std::optional(*lists)
+                                                         : load_restrictions_file(platform_).dictionary);
 
   const PropertyListArray* registryPaths = array_value(cache, registryPathsKey);
   if (registryPaths) {
@@ -123,7 +123,8 @@ void KELDataStore::loadCache() {
 void KELDataStore::restoreLocators(const PropertyListDictionary& directories) {
   auto locators = std::make_shared<Locators>();
   for (const auto& [directory, paths] : directories) {
-    auto locator = std::make_shared<KELServicesProviderLocator>(platform_.files, directory.text());
+    auto locator =
+        std::make_shared<KELServicesProviderLocator>(platform_.files, platform_.log, directory.text());
     if (const PropertyListArray* array = paths.asArray()) {
       for (std::string& path : stringElements(*array)) locator->paths().insert(std::move(path));
     }
@@ -157,7 +158,8 @@ PropertyListValue KELDataStore::cacheFileContents() const {
     entries.set(path, entry->cacheRepresentation());
   }
   PropertyListDictionaryBuilder contents;
-  contents.set(lastEventIDKey, eventStreamID_);
+  // Without a position everything is looked at again: what could not be read must not be taken for read.
+  contents.set(lastEventIDKey, unsettledSources() ? 0 : eventStreamID_);
   contents.set(explicitDirectoryCacheKey, directories.build());
   contents.set(servicesCacheKey, entries.build());
   if (const auto lists = restriction_lists_to_plist(restrictionLists_.get()))

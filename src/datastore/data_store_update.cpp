@@ -73,8 +73,11 @@ void KELDataStore::updateServicesCache(KELStaleCacheFlags flags) {
   }
   apply_concurrently(platform_.concurrentQueue, mapValues(entries),
                      [](const std::shared_ptr<KELAppEntry>& entry) { entry->refreshCache(); });
-  // Kept, an entry that failed would be taken for known by the next update, and its old values for true.
-  std::erase_if(entries, [](const auto& item) { return !item.second->servicesCacheIsValid(); });
+  // Kept, an entry that failed would be taken for known by the next update, and its old values for true. One
+  // that could not be read for the moment keeps what was known, and is not valid.
+  std::erase_if(entries, [](const auto& item) {
+    return !item.second->servicesCacheIsValid() && !item.second->bundleIsUnsettled();
+  });
   pathsToAppEntries_ = std::make_shared<const AppEntries>(std::move(entries));
 }
 
@@ -85,13 +88,25 @@ KELStaleCacheFlags KELDataStore::widenedFlags(KELStaleCacheFlags flags) const {
   return flags;
 }
 
+std::optional<KELStaleCacheFlags> KELDataStore::unsettledSources() const {
+  KELStaleCacheFlags flags = 0;
+  if (registryIsUnsettled_) flags |= KELStaleAppRegistryPaths;
+  if (restrictionsAreUnsettled_) flags |= KELStaleRestrictionLists;
+  const auto isUnsettled = [](const auto& item) { return item.second->isUnsettled(); };
+  if (pathsToLocators_ && std::ranges::any_of(*pathsToLocators_, isUnsettled))
+    flags |= KELStaleServiceDirectories;
+  // An entry is looked at again by every update, whatever its flags.
+  const bool entryIsUnsettled = pathsToAppEntries_ && std::ranges::any_of(*pathsToAppEntries_, isUnsettled);
+  return flags != 0 || entryIsUnsettled ? std::optional(flags) : std::nullopt;
+}
+
 /// Reads the sources named by `flags` in parallel and installs what they gave. Returns the observer of
 /// changes since the last look at the directories, when they are looked at now and that position is known.
 std::shared_ptr<KELPathChangesObserver> KELDataStore::readStaleSources(KELStaleCacheFlags flags) {
   std::shared_ptr<KELPathChangesObserver> observer;
   std::shared_ptr<const Locators> newLocators;
-  std::shared_ptr<const std::vector<std::string>> newRegistryPaths;
-  std::shared_ptr<const KELRestrictionLists> newRestrictionLists;
+  RegistryPaths newRegistryPaths;
+  platform::DictionaryReading newRestrictions;
 
   platform::Group group;
   const auto start = [this, &group, sink = current_debug_sink()](std::function<void()> task) {
@@ -107,21 +122,26 @@ std::shared_ptr<KELPathChangesObserver> KELDataStore::readStaleSources(KELStaleC
     start([&] { newLocators = refreshedLocators(observer.get()); });
   }
   if (flags & KELStaleAppRegistryPaths) {
-    start([&] {
-      newRegistryPaths = std::make_shared<const std::vector<std::string>>(service_providing_paths(platform_));
-    });
+    start([&] { newRegistryPaths = service_providing_paths(platform_); });
   }
   if (flags & KELStaleRestrictionLists) {
-    start([&] {
-      newRestrictionLists =
-          restriction_lists_from_plist(load_restrictions_file(platform_.files, platform_.directories));
-    });
+    start([&] { newRestrictions = load_restrictions_file(platform_); });
   }
   group.wait();
 
   if (newLocators) pathsToLocators_ = std::move(newLocators);
-  if (newRegistryPaths) pathsFromAR_ = std::move(newRegistryPaths);
-  if (newRestrictionLists) restrictionLists_ = std::move(newRestrictionLists);
+  if (flags & KELStaleAppRegistryPaths) {
+    registryIsUnsettled_ = !newRegistryPaths.isWhole;
+    // A part of the applications takes the place of none, never that of all that were known.
+    if (newRegistryPaths.isWhole || !pathsFromAR_ || pathsFromAR_->empty()) {
+      pathsFromAR_ = std::make_shared<const std::vector<std::string>>(std::move(newRegistryPaths.paths));
+    }
+  }
+  if (flags & KELStaleRestrictionLists) {
+    restrictionsAreUnsettled_ = newRestrictions.isTransient;
+    if (auto lists = restriction_lists_from_plist(newRestrictions.dictionary))
+      restrictionLists_ = std::move(lists);
+  }
   return observer;
 }
 
@@ -138,7 +158,7 @@ std::shared_ptr<const KELDataStore::Locators> KELDataStore::refreshedLocators(
     }
     // A new locator is listed in any case: there is nothing that the journal could keep valid.
     if (!locator) {
-      locator = std::make_shared<KELServicesProviderLocator>(platform_.files, directory);
+      locator = std::make_shared<KELServicesProviderLocator>(platform_.files, platform_.log, directory);
     } else if (locator->directoryContentsCacheIsValid()) {
       unchangedDirectories.push_back(directory);
     }

@@ -9,13 +9,14 @@
 
 namespace kel {
 
-std::vector<std::string> service_providing_paths(platform::Platform& platform) {
+RegistryPaths service_providing_paths(platform::Platform& platform) {
   constexpr std::uint32_t mask = platform::ApplicationRegistry::providesServices;
+  const platform::RegisteredApplications registered = platform.applications.applications(mask, mask);
   std::vector<std::string> paths =
-      map_array(platform.applications.applications(mask, mask),
+      map_array(registered.applications,
                 [](const platform::RegisteredApplication& application) { return application.path; });
   send_debug_line([&] { return "Service providing paths:\n\t" + join(paths, "\n\t"); });
-  return paths;
+  return {std::move(paths), registered.isWhole};
 }
 
 std::string parent_directory(std::string_view path) {

@@ -8,9 +8,15 @@
 
 namespace kel {
 
-/// The paths of the registered applications that provide services, in the registry's order. Any thread; may
-/// take as long as reading every information dictionary takes.
-std::vector<std::string> service_providing_paths(platform::Platform& platform);
+/// The paths of applications, in the registry's order.
+struct RegistryPaths {
+  std::vector<std::string> paths;
+  bool isWhole = true;  ///< false when some could not be found out about for the moment
+};
+
+/// The registered applications that provide services. Any thread; may take as long as reading every
+/// information dictionary takes.
+RegistryPaths service_providing_paths(platform::Platform& platform);
 
 /// What to watch so that changes in any of `paths` are seen: a directory in place of three or more paths in
 /// it, and nothing that lies under something else that is watched. In no particular order.

@@ -4,6 +4,7 @@
 #include <string>
 
 #include "platform/file_system.h"
+#include "platform/system_log.h"
 
 namespace kel {
 
@@ -14,10 +15,11 @@ namespace kel {
 class KELServicesProviderLocator {
  public:
   /// A locator that knows nothing yet.
-  KELServicesProviderLocator(platform::FileSystem& files, std::string basePath);
+  KELServicesProviderLocator(platform::FileSystem& files, platform::SystemLog& log, std::string basePath);
 
   /// Lists the directory anew unless the remembered listing counts as valid. A directory that cannot be
-  /// listed counts as empty, and as listed.
+  /// listed counts as empty, and as listed; one that cannot be listed for the moment keeps its names and is
+  /// not valid, and the system log is told once.
   void refreshCache();
 
   /// The live set of entry paths; the cache file's listing is restored through it.
@@ -28,11 +30,16 @@ class KELServicesProviderLocator {
   bool directoryContentsCacheIsValid() const { return directoryContentsCacheIsValid_; }
   void setDirectoryContentsCacheIsValid(bool valid) { directoryContentsCacheIsValid_ = valid; }
 
+  /// The directory could not be listed for the moment and is to be looked at again.
+  bool isUnsettled() const { return isUnsettled_; }
+
  private:
   platform::FileSystem& files_;
+  platform::SystemLog& log_;
   std::set<std::string> paths_;
   const std::string basePath_;
   bool directoryContentsCacheIsValid_ = false;
+  bool isUnsettled_ = false;
 };
 
 }  // namespace kel

@@ -82,6 +82,7 @@ void KELAppEntry::refreshCache() {
   const std::unique_ptr<platform::Bundle> bundle = createBundle();
   if (!bundle) {
     send_debug_line([&] { return "Unable to create a bundle for path " + bundlePath() + ", skipping it"; });
+    bundleError_.clear();
     return;
   }
   if (loadFromBundle(bundle.get())) servicesCacheIsValid_ = true;
@@ -90,8 +91,9 @@ void KELAppEntry::refreshCache() {
 bool KELAppEntry::loadFromBundle(platform::Bundle* bundle) {
   send_debug_line([&] { return "Loading Services from path " + bundlePath(); });
   if (!bundle) return false;
+  auto [information, error] = bundle->information();
+  if (!settle(bundleError_, std::move(error))) return false;
   Value identifier = bundle->identifier();
-  const PropertyListDictionary information = bundle->informationDictionary();
   Value name = copied(information.find(information_keys::name));
   Value version = copied(information.find(information_keys::version));
   Value services = copied(information.find(information_keys::services));
@@ -121,10 +123,11 @@ void KELAppEntry::loadLocalizations(const std::vector<std::string>& localization
     }
     // Opened for the first localization that nothing is known of, and then for all.
     if (!bundle && !(bundle = createBundle())) break;
-    PropertyListValue found = lookUpMenuStrings(*bundle, localization);
-    const bool usable = !isFalseMarker(found);
+    Value found = lookUpMenuStrings(*bundle, localization);
+    if (!found) break;
+    const bool usable = !isFalseMarker(*found);
     if (usable || tables.size() + (known ? known->size() : 0) < mostRemembered) {
-      tables.set(localization, std::move(found));
+      tables.set(localization, *std::move(found));
     }
     if (usable) break;
   }
@@ -135,20 +138,30 @@ void KELAppEntry::loadLocalizations(const std::vector<std::string>& localization
   setLocalizationToMenuStrings(tables.build());
 }
 
-/// The strings table of the bundle for `localization`, or false when it has no usable one.
-PropertyListValue KELAppEntry::lookUpMenuStrings(platform::Bundle& bundle,
-                                                 const std::string& localization) const {
+/// The strings table of the bundle for `localization`, or false when it has no usable one; absent when that
+/// cannot be told for the moment.
+KELAppEntry::Value KELAppEntry::lookUpMenuStrings(platform::Bundle& bundle, const std::string& localization) {
   if (const auto path = bundle.resourcePath("ServicesMenu", "strings", localization)) {
     platform::DictionaryReading reading = platform::readDictionaryFile(
         platform_.files, *path, platform::largestForeignFile, platform::bundleFileLimits);
+    if (!settle(stringsError_, reading.isTransient ? reading.error : "")) return std::nullopt;
     if (reading.dictionary) {
       send_debug_line([&] { return "Read localization " + localization + " in app " + bundlePath(); });
       return *std::move(reading.dictionary);
     }
     send_debug_line([&] { return "Unable to read strings file " + *path; });
+    platform_.log.write("Unable to read strings file " + *path + ": " + reading.error);
   }
   send_debug_line([&] { return "No entry for localization " + localization + " in app " + bundlePath(); });
-  return false;
+  return PropertyListValue(false);
+}
+
+/// Notes why something that belongs to the entry cannot be read for the moment, or with no error that it can;
+/// true for the latter. The log hears of it once, however often it is tried.
+bool KELAppEntry::settle(std::string& source, std::string error) {
+  if (source.empty() && !error.empty()) platform_.log.write("Cannot be read for now, trying again: " + error);
+  source = std::move(error);
+  return source.empty();
 }
 
 }  // namespace kel

@@ -55,11 +55,13 @@ class KELAppEntry {
 
   /// Takes identifier, name, version and declared services from `bundle` (may be null: false, and nothing
   /// changes) and forgets the menu strings when any of them is new. False, with a report in the system log,
-  /// when they are malformed; they are kept all the same.
+  /// when they are malformed; they are kept all the same. False also when they cannot be read for the moment:
+  /// then nothing changes, and the system log is told once.
   bool loadFromBundle(platform::Bundle* bundle);
 
   /// Finds menu strings for the first of `localizations`, most preferred first, that the bundle has a usable
-  /// file for. Those before it are remembered as having none, so that the disk is not searched again.
+  /// file for. Those before it are remembered as having none, so that the disk is not searched again. At one
+  /// that cannot be read for the moment the search ends, to be made again.
   void loadLocalizations(const std::vector<std::string>& localizations);
 
   /// True when the four values read from the bundle have the kinds that services need; otherwise false, and
@@ -100,13 +102,18 @@ class KELAppEntry {
   bool servicesCacheIsValid() const { return servicesCacheIsValid_; }
   void setServicesCacheIsValid(bool valid) { servicesCacheIsValid_ = valid; }
 
+  /// The bundle, or a strings file of it, could not be read for the moment: what is known of it stays, and it
+  /// is to be looked at again.
+  bool bundleIsUnsettled() const { return !bundleError_.empty(); }
+  bool isUnsettled() const { return bundleIsUnsettled() || !stringsError_.empty(); }
+
  private:
   struct MenuStringsTables;
 
   KELAppEntry(platform::Platform& platform, std::string bundlePath);
 
-  platform::PropertyListValue lookUpMenuStrings(platform::Bundle& bundle,
-                                                const std::string& localization) const;
+  Value lookUpMenuStrings(platform::Bundle& bundle, const std::string& localization);
+  bool settle(std::string& source, std::string error);
 
   // These two throw for a value that they cannot handle.
   platform::PropertyListDictionaryBuilder transformServiceDictionaryForPlist(
@@ -125,6 +132,10 @@ class KELAppEntry {
   platform::Guarded<Value> infoPlistServiceDictionaries_;
   platform::Guarded<Value> localizationToMenuStrings_;
   bool servicesCacheIsValid_ = false;
+
+  // Why the bundle and a strings file could not be read for the moment; empty when they could.
+  std::string bundleError_;
+  std::string stringsError_;
 };
 
 /// The directories whose bundles win over copies elsewhere, highest precedence first. Built at the first use

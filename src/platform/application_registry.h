@@ -11,6 +11,12 @@ struct RegisteredApplication {
   std::optional<std::string> path;  ///< of its bundle; absent when its location is no file
 };
 
+/// The registered applications, in the registry's order.
+struct RegisteredApplications {
+  std::vector<RegisteredApplication> applications;
+  bool isWhole = true;  ///< false when some could not be found out about for the moment
+};
+
 /// The installed applications. Any thread; may take as long as reading every information dictionary takes.
 class ApplicationRegistry {
  public:
@@ -19,8 +25,8 @@ class ApplicationRegistry {
 
   virtual ~ApplicationRegistry() = default;
 
-  /// The applications whose information flags, masked with `mask`, equal `value`, in the registry's order.
-  virtual std::vector<RegisteredApplication> applications(std::uint32_t mask, std::uint32_t value) = 0;
+  /// The applications whose information flags, masked with `mask`, equal `value`.
+  virtual RegisteredApplications applications(std::uint32_t mask, std::uint32_t value) = 0;
 };
 
 }  // namespace kel::platform

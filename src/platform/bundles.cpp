@@ -7,13 +7,15 @@ std::optional<PropertyListValue> bundleIdentifier(const PropertyListDictionary& 
   return identifier ? std::optional(*identifier) : std::nullopt;
 }
 
+bool canNameLocalization(std::string_view name) {
+  using namespace std::string_view_literals;
+  return !name.empty() && name.size() <= longestLocalizationName && name.front() != '.' &&
+         name.find_first_of("/\0"sv) == std::string_view::npos;
+}
+
 std::optional<std::string> localizedResourceName(std::string_view name, std::string_view type,
                                                  std::string_view localization) {
-  using namespace std::string_view_literals;
-  if (localization.empty() || localization.size() > longestLocalizationName || localization.front() == '.' ||
-      localization.find_first_of("/\0"sv) != std::string_view::npos) {
-    return std::nullopt;
-  }
+  if (!canNameLocalization(localization)) return std::nullopt;
   return std::string("Resources/").append(localization).append("/").append(name).append(".").append(type);
 }
 

@@ -5,7 +5,7 @@ namespace kel::platform {
 DictionaryReading readDictionaryFile(FileSystem& files, const std::string& path, std::size_t largest,
                                      const PropertyListLimits& limits) {
   const FileReading file = files.read(path, largest);
-  if (!file.bytes) return {std::nullopt, file.error};
+  if (!file.bytes) return {std::nullopt, file.error, file.isTransient};
   const PropertyListReading reading = readPropertyList(*file.bytes, limits);
   if (!reading.value) return {std::nullopt, reading.error};
   const PropertyListDictionary* dictionary = reading.value->asDictionary();

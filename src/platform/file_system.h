@@ -10,10 +10,22 @@
 
 namespace kel::platform {
 
+// What cannot be had may be had in a moment: an input error, no descriptor or memory left, a stale handle.
+// Such a failure is transient and no answer: whoever knew something goes on knowing it and looks again soon.
+// "Not there", "no directory" and "not permitted" are answers.
+
 /// Bytes, or one line that says why there are none.
 struct FileReading {
   std::optional<Bytes> bytes;
   std::string error;
+  bool isTransient = false;
+};
+
+/// Names, or one line that says why there are none.
+struct DirectoryReading {
+  std::optional<std::vector<std::string>> names;
+  std::string error;
+  bool isTransient = false;
 };
 
 /// Files and directories. Any thread. Operations that can fail return the reason as one line.
@@ -21,9 +33,9 @@ class FileSystem {
  public:
   virtual ~FileSystem() = default;
 
-  /// The names of all entries directly inside `directory`, hidden ones included, without "." and ".."; absent
-  /// when it cannot be listed. A name that is no UTF-8 is left out, with a line in the system log.
-  virtual std::optional<std::vector<std::string>> listDirectory(const std::string& directory) = 0;
+  /// The names of all entries directly inside `directory`, hidden ones included, without "." and "..". A name
+  /// that is no UTF-8 is left out, with a line in the system log.
+  virtual DirectoryReading listDirectory(const std::string& directory) = 0;
 
   virtual bool exists(const std::string& path) = 0;
 
@@ -54,6 +66,7 @@ inline constexpr PropertyListLimits bundleFileLimits{256, 64 * 1024 * 1024};
 struct DictionaryReading {
   std::optional<PropertyListDictionary> dictionary;
   std::string error;
+  bool isTransient = false;
 };
 DictionaryReading readDictionaryFile(FileSystem& files, const std::string& path, std::size_t largest,
                                      const PropertyListLimits& limits = {});

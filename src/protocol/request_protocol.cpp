@@ -41,8 +41,15 @@ bool wants_debug(const PropertyListDictionary& request) {
 std::vector<std::string> requested_localizations(const PropertyListDictionary& request) {
   const PropertyListArray* names = array_value(request, protocol::localizations);
   if (!names) return {};
-  const std::span first(names->begin(), std::min(names->size(), mostRequestedLocalizations));
-  return map_array(first, [](const PropertyListValue& name) { return name.asString(); });
+  return map_array(*names, [](const PropertyListValue& name) {
+    const std::string* text = name.asString();
+    return text && platform::canNameLocalization(*text) ? text : nullptr;
+  });
+}
+
+bool names_too_many_localizations(const PropertyListDictionary& request) {
+  const PropertyListArray* names = array_value(request, protocol::localizations);
+  return names && names->size() > mostRequestedLocalizations;
 }
 
 void send_kel_command(platform::Platform& platform, std::string_view command, bool debug,

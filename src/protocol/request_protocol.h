@@ -43,10 +43,14 @@ bool refused_to_sandboxed(KELCommand command);
 /// The request's "debug" entry; anything but a boolean counts as false.
 bool wants_debug(const platform::PropertyListDictionary& request);
 
-/// How many names of one request are looked at: each may cost a look at every bundle.
+/// How many names one request may have: each may cost a look at every bundle.
 inline constexpr std::size_t mostRequestedLocalizations = 64;
 
-/// The first of the "localizations" of a request classified as `KELCommandLocalizations`, in their order.
+/// True when a request classified as `KELCommandLocalizations` has more names than that.
+bool names_too_many_localizations(const platform::PropertyListDictionary& request);
+
+/// The "localizations" of a request classified as `KELCommandLocalizations` that can name one, in their
+/// order.
 std::vector<std::string> requested_localizations(const platform::PropertyListDictionary& request);
 
 /// Takes the reply to a request, or the error object that came in its place.

@@ -47,13 +47,17 @@ PropertyListArray rowsUnder(const PropertyListDictionary& plist, std::string_vie
 
 }  // namespace
 
-std::optional<PropertyListDictionary> load_restrictions_file(platform::FileSystem& files,
-                                                             platform::StandardDirectories& directories) {
-  const std::vector<std::string> libraries = directories.systemLibraryDirectories();
-  if (libraries.empty()) return std::nullopt;
+platform::DictionaryReading load_restrictions_file(platform::Platform& platform) {
+  const std::vector<std::string> libraries = platform.directories.systemLibraryDirectories();
+  if (libraries.empty()) return {};
   const std::string path =
       platform::joinPath(platform::joinPath(libraries.back(), "CoreAgents"), restrictionsFileName);
-  return platform::readDictionaryFile(files, path, platform::largestForeignFile).dictionary;
+  platform::DictionaryReading reading =
+      platform::readDictionaryFile(platform.files, path, platform::largestForeignFile);
+  if (!reading.dictionary && platform.files.exists(path)) {
+    platform.log.write("Cannot read the restrictions file " + path + ": " + reading.error);
+  }
+  return reading;
 }
 
 std::shared_ptr<const KELRestrictionLists> restriction_lists_from_plist(

@@ -45,9 +45,9 @@ class ServiceView {
 inline constexpr const char* restrictionsFileName = "com.orvex.QVServicesRestrictions.plist";
 
 /// Reads the restrictions file, in "CoreAgents" of the system's library directory, anew. None when there is
-/// no such file or it is no property list with a dictionary at its top.
-std::optional<platform::PropertyListDictionary> load_restrictions_file(
-    platform::FileSystem& files, platform::StandardDirectories& directories);
+/// no such file or it is no property list with a dictionary at its top; a line in the system log says what is
+/// wrong with one that is there.
+platform::DictionaryReading load_restrictions_file(platform::Platform& platform);
 
 /// Both lists mapped by `transform`, which gives an optional row; rows that are none drop out.
 template <typename Row, typename Transform>

@@ -21,7 +21,8 @@ using Entries = std::vector<KELRestrictionListEntry>;
 
 Entries vendorServicesOf(const PropertyListValue& publication) {
   const PropertyListDictionary* dictionary = publication.asDictionary();
-  const PropertyListArray* services = dictionary ? array_value(*dictionary, platform::publishedListKey) : nullptr;
+  const PropertyListArray* services =
+      dictionary ? array_value(*dictionary, platform::publishedListKey) : nullptr;
   if (!services) return {};
   return map_array(*services, [](const PropertyListValue& value) {
     const PropertyListDictionary* service = value.asDictionary();

@@ -14,10 +14,6 @@ namespace {
 
 constexpr std::size_t mostKnownLocalizations = 256;
 
-bool namesNothing(const std::string& localization) {
-  return localization.size() > platform::longestLocalizationName;
-}
-
 const PropertyListDictionary& dictionaryOf(const ConduitMessage* message) {
   static const PropertyListDictionary empty;
   const PropertyListDictionary* dictionary = message ? message->contents().asDictionary() : nullptr;
@@ -94,7 +90,6 @@ void KELServer::performGet(KELCommand command, const ConduitMessage* message, co
   if (command == KELCommand::KELCommandLocalizations) {
     localizations = requested_localizations(dictionaryOf(message));
     newLocalization = noteNewLocalization(localizations);
-    std::erase_if(localizations, namesNothing);
   }
   if (!currentData()) flags = loadFirstList(flags);
   if (newLocalization || flags != 0) {
@@ -117,10 +112,7 @@ void KELServer::performGet(KELCommand command, const ConduitMessage* message, co
 /// as new again.
 bool KELServer::noteNewLocalization(const std::vector<std::string>& localizations) {
   const auto known = knownLoadedLocalizations_.copy();
-  if (localizations.empty() || namesNothing(localizations.front()) ||
-      known->contains(localizations.front())) {
-    return false;
-  }
+  if (localizations.empty() || known->contains(localizations.front())) return false;
   auto extended = std::make_shared<Localizations>(*known);
   if (extended->size() >= mostKnownLocalizations) extended->erase(extended->begin());
   extended->insert(localizations.front());

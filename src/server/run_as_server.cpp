@@ -31,6 +31,11 @@ void handleRequest(platform::Platform& platform, KELServer& server,
                        platform::describeBriefly(message->contents()) + "\n");
     return;
   }
+  if (command == KELCommand::KELCommandLocalizations && names_too_many_localizations(request)) {
+    platform.log.write(std::string(routine) + ": refusing request for more than " +
+                       std::to_string(mostRequestedLocalizations) + " localizations\n");
+    return;
+  }
   server.conduitQueue().assertCurrent();
   server.performCommand(command, message, wants_debug(request) && !sandboxed, sandboxed);
 }

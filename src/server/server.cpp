@@ -124,6 +124,24 @@ void KELServer::updateServicesCache(KELStaleCacheFlags flags, std::uint32_t ifGe
   inDataStore.fetchLocalizations(std::vector<std::string>(localizations->begin(), localizations->end()));
   lastMadeData_ = setCurrentPublicDictionariesAllowingNotification(inDataStore.currentPublicDictionaries());
   inDataStore.writeCaches();
+  lookAgainAt(inDataStore.unsettledSources());
+}
+
+/// Has what could not be read for the moment read again, after seconds at first and then after minutes, until
+/// nothing is left. Nobody asks for it: who waits for the seed must hear of it.
+void KELServer::lookAgainAt(std::optional<KELStaleCacheFlags> unsettledSources) {
+  static constexpr std::chrono::seconds latest{300};
+  if (!unsettledSources) lookAgainAfter_ = soonestNextLook;
+  lookAgainFor_ = unsettledSources.value_or(0);
+  if (!unsettledSources || std::exchange(isToLookAgain_, true)) return;
+  platform_.clock.after(datastoreQueue_, lookAgainAfter_, [this] {
+    sync(false, [this](KELDataStore& dataStore) {
+      datastoreQueue_.assertCurrent();
+      isToLookAgain_ = false;
+      lookAgainAfter_ = std::min(2 * lookAgainAfter_, latest);
+      updateServicesCache(lookAgainFor_, currentGenCount_, dataStore);
+    });
+  });
 }
 
 void KELServer::reactToAppRegistrySeedingComplete() {

@@ -85,6 +85,8 @@ class KELServer {
   Localizations knownLoadedLocalizations() const { return *knownLoadedLocalizations_.copy(); }
 
  private:
+  static constexpr std::chrono::seconds soonestNextLook{5};
+
   /// Sends the reply with the current list, else with `otherwise`, which may be null.
   using ReplyAction = std::function<void(const platform::SharedBytes& otherwise)>;
 
@@ -98,6 +100,7 @@ class KELServer {
   bool noteNewLocalization(const std::vector<std::string>& localizations) KEL_RUNS_ON(conduitQueue_);
   KELStaleCacheFlags loadFirstList(KELStaleCacheFlags flags) KEL_RUNS_ON(conduitQueue_);
   std::uint32_t requestRebuild(KELStaleCacheFlags flags) KEL_RUNS_ON(conduitQueue_);
+  void lookAgainAt(std::optional<KELStaleCacheFlags> unsettledSources) KEL_RUNS_ON(datastoreQueue_);
 
   // Fixed after construction.
   platform::Platform& platform_;
@@ -119,6 +122,9 @@ class KELServer {
   KELEventReactor_t ARReactor_ KEL_ON(conduitQueue_);
   KELEventReactor_t VigilReactor_ KEL_ON(conduitQueue_);
   KELStaleCacheFlags staleCacheFlags_ KEL_ON(conduitQueue_) = 0;
+  KELStaleCacheFlags lookAgainFor_ KEL_ON(datastoreQueue_) = 0;
+  bool isToLookAgain_ KEL_ON(datastoreQueue_) = false;
+  std::chrono::seconds lookAgainAfter_ KEL_ON(datastoreQueue_) = soonestNextLook;
 
   // Last, so that work still queued at destruction finds everything above: the conduit queue ends first.
   platform::SerialQueue seedQueue_{"KEL Seed"};

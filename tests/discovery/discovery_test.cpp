@@ -21,10 +21,11 @@ constexpr std::uint32_t wrapped = platform::event_flags::eventIDsWrapped;
 
 TEST(ServicesProviderLocatorTest, ListsOnceKeepsVisibleEntriesOfEveryKindAndMissingDirectoriesAsEmpty) {
   test::InMemoryFileSystem files;
+  test::RecordingLog log;
   for (const std::string name : {"x.service/Info.plist", ".hidden", "notes.txt"})
     files.addText("/A/Services/" + name, "");
   for (const std::string base : {"/A/Services/", "/A/Services"}) {
-    KELServicesProviderLocator locator(files, base);
+    KELServicesProviderLocator locator(files, log, base);
     EXPECT_EQ(debugLines([&] { locator.refreshCache(); }), "Scanning directory: " + base);
     EXPECT_THAT(locator.paths(), ElementsAre("/A/Services/notes.txt", "/A/Services/x.service"));
     files.addText("/A/Services/later.service", "");
@@ -32,8 +33,15 @@ TEST(ServicesProviderLocatorTest, ListsOnceKeepsVisibleEntriesOfEveryKindAndMiss
     EXPECT_THAT(locator.paths(), testing::SizeIs(2)) << "a valid listing was read again";
     files.removeTree("/A/Services/later.service");
   }
-  KELServicesProviderLocator missing(files, "/none/");
+  KELServicesProviderLocator missing(files, log, "/none/");
   missing.paths().insert("/none/restored");
+  files.setFailing({"/none"});
+  for (int attempt = 0; attempt < 2; ++attempt) missing.refreshCache();
+  EXPECT_TRUE(missing.isUnsettled() && !missing.directoryContentsCacheIsValid());
+  EXPECT_THAT(missing.paths(), testing::SizeIs(1))
+      << "a listing that failed for now replaced one that did not";
+  EXPECT_THAT(log.take(), testing::SizeIs(1));
+  files.setFailing({});
   EXPECT_EQ(debugLines([&] { missing.refreshCache(); }), "Scanning directory: /none/");
   EXPECT_THAT(missing.paths(), IsEmpty());
   EXPECT_TRUE(missing.directoryContentsCacheIsValid());

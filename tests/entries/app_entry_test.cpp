@@ -107,6 +107,12 @@ TEST_F(AppEntryTest, LocalizationWalkStopsAtTheFirstUsableFileAndRemembersTheMis
   };
   entry->setLocalizationToMenuStrings("damaged");
   EXPECT_EQ(load({}), "");
+  system.files.setFailing({files + "German/ServicesMenu.strings"});
+  for (int attempt = 0; attempt < 2; ++attempt) load({"German", "English"});
+  EXPECT_TRUE(entry->isUnsettled() && entry->localizationToMenuStrings() == Value("damaged"));
+  EXPECT_THAT(system.log.take(), SizeIs(1)) << "what may pass is told once, and is no answer";
+  system.bundles.opens = 0;
+  system.files.setFailing({});
   EXPECT_EQ(load({"French", "German", "English"}),
             none("French") + "\nRead localization German in app " + path);
   EXPECT_EQ(entry->localizationToMenuStrings(), Value(dictionary({{"French", false}, {"German", german}})));

@@ -56,7 +56,7 @@ struct FilesContract : testing::Test {
     const FileReading reading = files.read(root + name, largest);
     return reading.bytes ? std::string(reading.bytes->begin(), reading.bytes->end()) : "E: " + reading.error;
   }
-  auto list(const std::string& name) { return files.listDirectory(root + name); }
+  auto list(const std::string& name) { return files.listDirectory(root + name).names; }
   bool exists(const std::string& name) { return files.exists(root + name); }
   bool remove(const std::string& name) { return files.remove(root + name); }
 
@@ -98,7 +98,7 @@ TYPED_TEST(FilesContract, BundleIsADirectoryWhoseInformationIsEmptyUnlessItIsADi
   EXPECT_FALSE(open("a"));
   this->write("a/file");
   EXPECT_FALSE(open("a/file"));
-  EXPECT_TRUE(open("a")->informationDictionary().empty());
+  EXPECT_TRUE(open("a")->information().dictionary.empty());
   const std::pair<std::string, PropertyListDictionary> rows[] = {
       {"{ KTBundleIdentifier = a; b = c; }", dictionary({{"KTBundleIdentifier", "a"}, {"b", "c"}})},
       {"{ KTBundleIdentifier = (a); }", dictionary({{"KTBundleIdentifier", Array{"a"}}})},
@@ -110,7 +110,7 @@ TYPED_TEST(FilesContract, BundleIsADirectoryWhoseInformationIsEmptyUnlessItIsADi
     this->write("a/Info.plist", text);
     const auto bundle = open("a");
     EXPECT_EQ(bundle->identifier(), bundleIdentifier(expected)) << text;
-    EXPECT_EQ(bundle->informationDictionary(), expected) << text;
+    EXPECT_EQ(bundle->information().dictionary, expected) << text;
   }
 }
 
@@ -144,7 +144,7 @@ TYPED_TEST(FilesContract, ApplicationsAreChosenByTheirFlagsUnderTheMask) {
   constexpr std::uint32_t services = ApplicationRegistry::providesServices;
   const auto found = [&](std::uint32_t mask, std::uint32_t value) {
     std::string initials;
-    for (const auto& each : this->world.registry.applications(mask, value))
+    for (const auto& each : this->world.registry.applications(mask, value).applications)
       initials += each.path->at(this->root.size());
     return initials;
   };

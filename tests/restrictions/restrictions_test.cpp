@@ -69,13 +69,16 @@ TEST(RestrictionListsTest, MarksWhatTheRulesRestrictAndNothingElse) {
 
 TEST(RestrictionListsTest, FileIsReadAnewFromTheLastSystemLibraryDirectory) {
   InMemoryPlatform system;
-  const auto load = [&] { return load_restrictions_file(system.files, system.directories); };
+  const auto load = [&] { return load_restrictions_file(system.platform).dictionary; };
   system.directories.systemLibraries = {"/Old/Library", "/System/Library"};
   const auto contents = dictionary({{"QVRestricted", Array{row("a", "1")}}});
   system.files.addPropertyList(restrictionsPath, contents);
   EXPECT_EQ(load(), contents);
+  EXPECT_THAT(system.log.take(), IsEmpty());
   system.files.addPropertyList(restrictionsPath, Array{});
-  EXPECT_FALSE(load()) << "no dictionary";
+  EXPECT_FALSE(load());
+  EXPECT_THAT(system.log.take(), ElementsAre("Cannot read the restrictions file " + restrictionsPath +
+                                             ": the top level is not a dictionary"));
   system.directories.systemLibraries.clear();
   EXPECT_FALSE(load()) << "no library directory";
 }

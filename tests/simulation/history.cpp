@@ -18,8 +18,9 @@ constexpr const char* directoryStream = platform::launch_streams::directoryChang
 
 /// The main thread of a server; it has what dies with it.
 struct ServerProcess : platform::Process {
-  explicit ServerProcess(World& world)
-      : platform{.clock = world.clock,
+  explicit ServerProcess(World& itsWorld)
+      : world(itsWorld),
+        platform{.clock = world.clock,
                  .concurrentQueue = pool,
                  .files = world.files,
                  .directories = world.directories,
@@ -44,6 +45,9 @@ struct ServerProcess : platform::Process {
     Scheduler::current().wait([] { return false; });
   }
 
+  ~ServerProcess() override { world.launchEvents.forgetHandlers(); }
+
+  World& world;
   platform::ConcurrentQueue pool;
   platform::ProcessConstants constants;
   platform::Platform platform;
@@ -81,6 +85,7 @@ History::~History() {
 
 void History::run() {
   world_.files.failsWrites = scheduler_.oneIn(4);
+  world_.files.failsReads = scheduler_.oneIn(4);
   startServer();
   scheduler_.spawn(
       "follower", [this] { follow(); }, outside_);
@@ -98,7 +103,7 @@ void History::run() {
 
   for (const auto& [path, changes] : bundles_) {
     const Title held = titleIn(held_, path);
-    if (!isKnowledge(changes, moment_, held)) {
+    if (!isKnowledge(changes, moment_, flushed_, held)) {
       fail("who follows the seed holds " + path + " as " + held.value_or("gone") + ", which is " +
            changes.back().title.value_or("gone"));
     }
@@ -133,7 +138,6 @@ void History::killServer() {
     if (!mayAct("the server is killed and started")) return;
     scheduler_.kill(*server_);
     flushed_ = 0;  // it may have been answered and not carried out
-    world_.launchEvents.forgetHandlers();
     if (scheduler_.oneIn(2)) world_.facts.boot.value = *world_.facts.boot.value + 1;
     if (scheduler_.oneIn(2)) world_.clock.wallClockOffset -= static_cast<double>(scheduler_.draw(100));
     startServer();
@@ -180,6 +184,7 @@ void History::ask() {
 void History::askFor(const Value& request, bool mustKnowAll) {
   if (!mayAct("asked for " + platform::describe(request))) return;
   const std::uint64_t sent = moment_;
+  const std::uint64_t flushed = flushed_;
   const platform::ConduitReply reply = world_.conduit.ask(request);
   const Value* contents = std::get_if<Value>(&reply);
   if (!contents) return;
@@ -192,17 +197,19 @@ void History::askFor(const Value& request, bool mustKnowAll) {
   const Titles titles = titlesIn(*platform::readPropertyList(**data->asData()).value);
   for (const auto& [path, changes] : bundles_) {
     const Title listed = titleIn(titles, path);
-    if (mustKnowAll && !isKnowledge(changes, sent, listed)) {
+    if (mustKnowAll && !world_.files.failsReads && !isKnowledge(changes, sent, flushed, listed)) {
       fail("an update answered with " + path + " as " + listed.value_or("gone"));
     }
   }
 }
 
-/// Whether somebody who asked at the moment `since`, and could be told what was known then, may hold `title`.
-bool History::isKnowledge(const std::vector<Change>& changes, std::uint64_t since, const Title& title) const {
+/// Whether somebody who asked at the moment `since` may hold `title`. What the journal did not tell need not
+/// be known unless a flush came after it.
+bool History::isKnowledge(const std::vector<Change>& changes, std::uint64_t since, std::uint64_t flushed,
+                          const Title& title) {
   for (auto change = changes.rbegin(); change != changes.rend(); ++change) {
     if (change->title == title) return true;
-    if (change->moment <= since && (change->isTold || change->moment <= flushed_)) return false;
+    if (change->moment <= since && (change->isTold || change->moment <= flushed)) return false;
   }
   return !title;
 }

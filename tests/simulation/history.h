@@ -43,7 +43,8 @@ class History {
   void change();
   void changeBundle(const std::string& name, bool isApplication);
   void announce(const std::string& stream);
-  bool isKnowledge(const std::vector<Change>& changes, std::uint64_t since, const Title& title) const;
+  static bool isKnowledge(const std::vector<Change>& changes, std::uint64_t since, std::uint64_t flushed,
+                          const Title& title);
 
   bool mayAct(const std::string& what);
 

@@ -65,7 +65,7 @@ SerialQueue::~SerialQueue() {
   QueueState& state = *body_->state;
   state.timers.clear();
   state.isFinishing = true;
-  if (!isCurrent()) Scheduler::current().wait([&state] { return state.hasEnded; });
+  if (!isCurrent()) Scheduler::current().waitWithoutThrowing([&state] { return state.hasEnded; });
 }
 
 const std::string& SerialQueue::label() const { return body_->state->label; }

@@ -114,13 +114,22 @@ bool Scheduler::wait(std::function<bool()> condition, Time timeout) {
 }
 
 bool Scheduler::wait(std::function<bool()> condition, std::function<Time()> deadline) {
+  const bool held = suspend(std::move(condition), std::move(deadline));
+  if (running_ && running_->process->isKilled && std::uncaught_exceptions() == 0) throw Killed();
+  return held;
+}
+
+void Scheduler::waitWithoutThrowing(std::function<bool()> condition) {
+  suspend(std::move(condition), [] { return never; });
+}
+
+bool Scheduler::suspend(std::function<bool()> condition, std::function<Time()> deadline) {
   // Outside every thread nothing can be waited for: what is built and torn down there waits for nobody.
-  if (!running_ || (running_->process->isKilled && std::uncaught_exceptions() > 0)) return true;
+  if (!running_ || running_->process->isKilled) return true;
   Thread& self = *running_;
   self.condition = std::move(condition);
   self.deadline = std::move(deadline);
   Fiber::suspend();
-  if (self.process->isKilled) throw Killed();
   const bool held = !self.condition || self.condition();
   self.condition = nullptr;
   return held;

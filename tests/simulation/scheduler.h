@@ -66,6 +66,8 @@ class Scheduler {
   /// Waits until `condition` holds, or until the time that `deadline` gives: then false.
   bool wait(std::function<bool()> condition, std::function<Time()> deadline);
   bool wait(std::function<bool()> condition, Time timeout = never);
+  /// For destructors: when the process was killed it goes on instead of throwing, up to the next wait.
+  void waitWithoutThrowing(std::function<bool()> condition);
   void sleep(Time duration) {
     wait([] { return false; }, duration);
   }
@@ -81,6 +83,7 @@ class Scheduler {
   struct Killed {};
   struct Thread;
 
+  bool suspend(std::function<bool()> condition, std::function<Time()> deadline);
   void resume(Thread& thread);
   void unwindKilled();
   void reap();

@@ -26,12 +26,16 @@ using test::Value;
 /// The disk: every operation of a server lets others go first, some fail. What was written stays.
 class Disk : public test::InMemoryFileSystem {
  public:
-  std::optional<std::vector<std::string>> listDirectory(const std::string& directory) override {
+  platform::DirectoryReading listDirectory(const std::string& directory) override {
     Scheduler::current().yield();
+    if (failsReads && Scheduler::current().oneIn(4))
+      return {std::nullopt, directory + ": no descriptor left", true};
     return InMemoryFileSystem::listDirectory(directory);
   }
   platform::FileReading read(const std::string& path, std::size_t largest) override {
     Scheduler::current().yield();
+    if (failsReads && Scheduler::current().oneIn(4))
+      return {std::nullopt, path + ": Input/output error", true};
     return InMemoryFileSystem::read(path, largest);
   }
   std::optional<std::string> writeAtomically(const std::string& path, platform::BytesView bytes) override {
@@ -45,6 +49,7 @@ class Disk : public test::InMemoryFileSystem {
   }
 
   bool failsWrites = false;
+  bool failsReads = false;
 };
 
 /// Seeds that never go back, whoever ends when.

@@ -15,16 +15,19 @@ class InMemoryBundle : public platform::Bundle {
  public:
   InMemoryBundle(InMemoryFileSystem& files, std::string path) : files_(files), path_(std::move(path)) {}
 
-  platform::PropertyListDictionary informationDictionary() override {
+  platform::InformationReading information() override {
     if (!information_) {
-      information_ = platform::readDictionaryFile(files_, platform::joinPath(path_, "Info.plist"),
-                                                  platform::largestForeignFile, platform::bundleFileLimits)
-                         .dictionary.value_or(platform::PropertyListDictionary());
+      const platform::DictionaryReading reading =
+          platform::readDictionaryFile(files_, platform::joinPath(path_, "Info.plist"),
+                                       platform::largestForeignFile, platform::bundleFileLimits);
+      information_ =
+          platform::InformationReading{reading.dictionary.value_or(platform::PropertyListDictionary()),
+                                       reading.isTransient ? reading.error : ""};
     }
     return *information_;
   }
   std::optional<platform::PropertyListValue> identifier() override {
-    return platform::bundleIdentifier(informationDictionary());
+    return platform::bundleIdentifier(information().dictionary);
   }
   std::optional<std::string> resourcePath(std::string_view name, std::string_view type,
                                           std::string_view localization) override {
@@ -36,7 +39,7 @@ class InMemoryBundle : public platform::Bundle {
  private:
   InMemoryFileSystem& files_;
   const std::string path_;
-  std::optional<platform::PropertyListDictionary> information_;
+  std::optional<platform::InformationReading> information_;
 };
 
 /// The bundles of an in-memory file system: a bundle is a directory with an "Info.plist" and a "Resources"

@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <map>
 #include <optional>
+#include <set>
 #include <stdexcept>
 #include <string>
 #include <string_view>
@@ -18,10 +19,11 @@ namespace kel::test {
 /// file makes the directories above it; a trailing "/" of a path does not count. Any thread.
 class InMemoryFileSystem : public platform::FileSystem {
  public:
-  std::optional<std::vector<std::string>> listDirectory(const std::string& directory) override {
-    return state_.with([&](State& state) -> std::optional<std::vector<std::string>> {
+  platform::DirectoryReading listDirectory(const std::string& directory) override {
+    return state_.with([&](State& state) -> platform::DirectoryReading {
       const Node* node = state.use(directory);
-      if (!node || *node) return std::nullopt;
+      if (state.failsFor(directory)) return {std::nullopt, directory + ": Input/output error", true};
+      if (!node || *node) return {std::nullopt, directory + ": no directory", false};
       const std::string prefix = normalised(directory) + "/";
       std::vector<std::string> names;
       for (auto at = state.nodes.upper_bound(prefix); at != state.nodes.end(); ++at) {
@@ -29,7 +31,7 @@ class InMemoryFileSystem : public platform::FileSystem {
         std::string name = at->first.substr(prefix.size());
         if (name.find('/') == std::string::npos) names.push_back(std::move(name));
       }
-      return names;
+      return {std::move(names), {}, false};
     });
   }
   bool exists(const std::string& path) override {
@@ -38,10 +40,11 @@ class InMemoryFileSystem : public platform::FileSystem {
   platform::FileReading read(const std::string& path, std::size_t largest) override {
     return state_.with([&](State& state) -> platform::FileReading {
       const Node* node = state.use(path);
-      if (!node) return {std::nullopt, "No such file or directory"};
-      if (!*node) return {std::nullopt, "not a regular file"};
-      if ((*node)->size() > largest) return {std::nullopt, "too large"};
-      return {*node, {}};
+      if (state.failsFor(path)) return {std::nullopt, path + ": Input/output error", true};
+      if (!node) return {std::nullopt, path + ": No such file or directory", false};
+      if (!*node) return {std::nullopt, path + ": not a regular file", false};
+      if ((*node)->size() > largest) return {std::nullopt, path + ": too large", false};
+      return {*node, {}, false};
     });
   }
   std::optional<std::string> writeAtomically(const std::string& path, platform::BytesView bytes) override {
@@ -92,6 +95,11 @@ class InMemoryFileSystem : public platform::FileSystem {
     state_.with([](State& state) { state.uses.clear(); });
   }
 
+  /// Reading or listing these paths fails, in a way that may pass, until the set is another.
+  void setFailing(std::set<std::string> paths) {
+    state_.with([&](State& state) { state.failing = std::move(paths); });
+  }
+
   /// The next write fails with `error` and changes nothing.
   void failNextWrite(std::string error) {
     state_.with([&](State& state) { state.nextWriteError = std::move(error); });
@@ -104,6 +112,9 @@ class InMemoryFileSystem : public platform::FileSystem {
     std::map<std::string, Node> nodes{{"/tmp", {}}, {"/tmp/u", {}}};  ///< by normalised path
     std::map<std::string, std::size_t> uses;
     std::optional<std::string> nextWriteError;
+    std::set<std::string> failing;
+
+    bool failsFor(const std::string& path) const { return failing.contains(normalised(path)); }
 
     const Node* find(const std::string& path) const {
       const auto found = nodes.find(normalised(path));

@@ -142,14 +142,14 @@ class InMemoryLaunchEvents : public platform::LaunchEvents {
 /// Applications that a test installs: those with services come first.
 class InMemoryRegistry : public platform::ApplicationRegistry {
  public:
-  std::vector<platform::RegisteredApplication> applications(std::uint32_t mask,
-                                                            std::uint32_t value) override {
+  platform::RegisteredApplications applications(std::uint32_t mask, std::uint32_t value) override {
     ++queries;
     auto result = (providesServices & mask) == value ? registered : decltype(registered)();
     if (value == 0) result.insert(result.end(), plain.begin(), plain.end());
-    return result;
+    return {std::move(result), isWhole};
   }
 
+  bool isWhole = true;  ///< else applications may be missing for the moment
   std::vector<platform::RegisteredApplication> registered;  ///< that provide services
   std::vector<platform::RegisteredApplication> plain;       ///< that set no flag
   std::atomic<std::size_t> queries = 0;

@@ -1,6 +1,7 @@
 #include "platform/linux/files/files.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -17,6 +18,12 @@ std::string errorText(int errorNumber) {
 
 std::string errorLine(const std::string& path, int errorNumber) {
   return path + ": " + errorText(errorNumber);
+}
+
+bool isTransient(int errorNumber) {
+  constexpr std::array answers{ENOENT, ENOTDIR, EACCES, EPERM, ELOOP, ENAMETOOLONG,
+                               EISDIR, EINVAL,  EFBIG,  ENXIO, ENODEV};
+  return std::ranges::find(answers, errorNumber) == answers.end();
 }
 
 bool isWhole(const std::string& path) {

@@ -21,6 +21,10 @@ std::string errorText(int errorNumber);
 /// "PATH: TEXT", one line for one failed operation.
 std::string errorLine(const std::string& path, int errorNumber);
 
+/// True for an error that may pass by itself (an input error, no descriptor or memory left, a stale handle),
+/// false for one that answers: nothing there, no directory, not permitted, not what is read here.
+bool isTransient(int errorNumber);
+
 /// False, with EINVAL, for a path that holds a NUL: the kernel would see a shorter one.
 bool isWhole(const std::string& path);
 

@@ -59,16 +59,19 @@ class TemporaryFile {
 
 }  // namespace
 
-std::optional<std::vector<std::string>> LinuxFileSystem::listDirectory(const std::string& directory) {
+DirectoryReading LinuxFileSystem::listDirectory(const std::string& directory) {
+  const auto failed = [&directory](int error) {
+    return DirectoryReading{std::nullopt, errorLine(directory, error), isTransient(error)};
+  };
   const DirectoryListing listing = openListing(directory);
-  if (!listing) return std::nullopt;
+  if (!listing) return failed(errno);
   std::vector<std::string> names;
   std::size_t unreadable = 0;
   for (;;) {
     // The end of the list and a failure differ in nothing but this.
     errno = 0;
     const dirent* entry = readdir(listing.get());
-    if (!entry && errno != 0) return std::nullopt;
+    if (!entry && errno != 0) return failed(errno);
     if (!entry) break;
     const std::string_view name(entry->d_name);
     if (name == "." || name == "..") continue;
@@ -81,7 +84,7 @@ std::optional<std::vector<std::string>> LinuxFileSystem::listDirectory(const std
   if (unreadable > 0) {
     log_.write(directory + ": left out " + std::to_string(unreadable) + " name(s) that are not UTF-8");
   }
-  return names;
+  return {std::move(names), {}, false};
 }
 
 bool LinuxFileSystem::exists(const std::string& path) {
@@ -91,8 +94,10 @@ bool LinuxFileSystem::exists(const std::string& path) {
 
 FileReading LinuxFileSystem::read(const std::string& path, std::size_t largest) {
   auto bytes = readFile(AT_FDCWD, path, largest);
-  if (!bytes) return {std::nullopt, errno == EINVAL ? path + ": not a regular file" : errorLine(path, errno)};
-  return {std::move(bytes), {}};
+  const int error = errno;
+  if (bytes) return {std::move(bytes), {}, false};
+  return {std::nullopt, error == EINVAL ? path + ": not a regular file" : errorLine(path, error),
+          isTransient(error)};
 }
 
 std::optional<std::string> LinuxFileSystem::writeAtomically(const std::string& path, BytesView bytes) {

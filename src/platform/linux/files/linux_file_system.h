@@ -17,7 +17,7 @@ class LinuxFileSystem final : public FileSystem {
  public:
   explicit LinuxFileSystem(SystemLog& log) : log_(log) {}
 
-  std::optional<std::vector<std::string>> listDirectory(const std::string& directory) override;
+  DirectoryReading listDirectory(const std::string& directory) override;
 
   /// Symbolic links are followed: a dangling one does not exist.
   bool exists(const std::string& path) override;

@@ -11,8 +11,9 @@ namespace kel::platform {
 /// The status (see `EntryStatus`) of an application's information dictionary, links followed.
 struct InformationStatus {
   EntryStatus status;  ///< of kind unknown, and else empty, when there is no such file or `isKnown` is false
-  bool isKnown = false;  ///< the kernel answered, be it that there is no such file
-  bool isLink = false;   ///< the dictionary lies somewhere else
+  bool isKnown = false;      ///< the kernel answered, be it that there is no such file
+  bool isTransient = false;  ///< it did not, for a reason that may pass by itself
+  bool isLink = false;       ///< the dictionary lies somewhere else
 
   bool exists() const { return status.kind != EntryKind::Unknown; }
 };

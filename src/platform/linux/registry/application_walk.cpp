@@ -65,7 +65,10 @@ class Walker {
     const bool isMissing = !listing && folders_ == 1 && (errno == ENOENT || errno == ENOTDIR);
     if (listing) errno = 0;
     const dirent* entry = listing ? readdir(listing) : nullptr;
-    if (!entry && errno != 0 && !isMissing) result_.incomplete = true;
+    if (!entry && errno != 0 && !isMissing) {
+      result_.incomplete = true;
+      result_.isTransient = result_.isTransient || platform::isTransient(errno);
+    }
     return entry;
   }
 

@@ -16,6 +16,7 @@ struct ApplicationWalk {
   std::vector<std::string> deadLinks;          ///< named like an application, but leading to no directory
   bool reachedLimit = false;                   ///< too many or too deep folders
   bool incomplete = false;                     ///< a limit or an error may hide applications
+  bool isTransient = false;                    ///< it is an error that may pass by itself
 };
 
 /// Lists the plain folders at and below `root`; no application is opened.

@@ -45,12 +45,11 @@ std::vector<std::string> LinuxApplicationRegistry::applicationDirectories(const 
           joinPath(home, "Applications/")};
 }
 
-std::vector<RegisteredApplication> LinuxApplicationRegistry::applications(std::uint32_t mask,
-                                                                          std::uint32_t value) {
-  const Applications all = current();
-  std::vector<RegisteredApplication> result;
-  for (const Application& application : *all) {
-    if ((application.flags & mask) == value) result.push_back({application.path});
+RegisteredApplications LinuxApplicationRegistry::applications(std::uint32_t mask, std::uint32_t value) {
+  const Scan last = current();
+  RegisteredApplications result{{}, last.isWhole};
+  for (const Application& application : *last.applications) {
+    if ((application.flags & mask) == value) result.applications.push_back({application.path});
   }
   return result;
 }
@@ -62,10 +61,10 @@ void LinuxApplicationRegistry::seed(std::function<void()> done) {
   });
 }
 
-LinuxApplicationRegistry::Applications LinuxApplicationRegistry::current() {
+LinuxApplicationRegistry::Scan LinuxApplicationRegistry::current() {
   const MutexLock lock(scanning_);
   if (!lastScanHolds()) last_ = scan();
-  return last_.applications;
+  return last_;
 }
 
 bool LinuxApplicationRegistry::lastScanHolds() const {
@@ -93,14 +92,20 @@ LinuxApplicationRegistry::Scan LinuxApplicationRegistry::scan() {
     auto& [path, isLink] = walk.applications[index];
     const Look& look = looks[index];
     isFinal = isFinal && look.isSettled;
-    if (look.isSettled) settled.emplace_hint(settled.end(), path, look.application);
+    result.isWhole = result.isWhole && !look.isTransient;
+    if (look.isSettled || look.isTransient) settled.emplace_hint(settled.end(), path, look.application);
     if (isLink || look.isLink) result.outsiders.push_back({path, true, look.application.information});
     applications.push_back({std::move(path), look.application.flags});
   }
   for (std::string& path : walk.deadLinks) result.outsiders.push_back({std::move(path), false, {}});
   result.applications = std::make_shared<const std::vector<Application>>(std::move(applications));
   if (isFinal) result.position = position;
-  remember(std::move(settled));
+  if (walk.isTransient) {
+    result.isWhole = false;
+    if (last_.applications) result.applications = last_.applications;
+  } else {
+    remember(std::move(settled));
+  }
   return result;
 }
 
@@ -111,6 +116,7 @@ ApplicationWalk LinuxApplicationRegistry::walkRoots() {
     if (walk.reachedLimit)
       log_.write("Too many or too deep folders in " + root + ": applications may be missing");
     all.incomplete = all.incomplete || walk.incomplete;
+    all.isTransient = all.isTransient || walk.isTransient;
     std::ranges::move(walk.applications, std::back_inserter(all.applications));
     std::ranges::move(walk.deadLinks, std::back_inserter(all.deadLinks));
   }
@@ -125,14 +131,17 @@ LinuxApplicationRegistry::Look LinuxApplicationRegistry::lookAt(const std::strin
                                                                 const RememberedApplications& memory) const {
   const InformationStatus before = informationStatus(application);
   const auto known = memory.find(application);
-  if (before.isKnown && known != memory.end() && known->second.information == before.status)
-    return {known->second, true, before.isLink};
+  const RememberedApplication earlier = known != memory.end() ? known->second : RememberedApplication();
+  if (before.isTransient) return {earlier, false, before.isLink, true};
+  if (before.isKnown && known != memory.end() && earlier.information == before.status)
+    return {earlier, true, before.isLink, false};
 
-  Look look{{before.status, 0}, before.isKnown, before.isLink};
+  Look look{{before.status, 0}, before.isKnown, before.isLink, false};
   if (!before.exists()) return look;
   look.isSettled = !isRacy(before.status.changed, timeStampNow(), TimeStamps::Local);
   if (before.status.kind != EntryKind::File || before.status.size > largestForeignFile) return look;
   const FileReading file = files_.read(informationPath(application), largestForeignFile);
+  if (file.isTransient) return {earlier, false, before.isLink, true};
   look.application.flags = file.bytes ? informationFlags(*file.bytes) : 0;
   look.isSettled = look.isSettled && file.bytes && informationStatus(application).status == before.status;
   return look;

@@ -40,8 +40,9 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
   static std::vector<std::string> applicationDirectories(const std::string& home);
 
   /// In the order of the roots, then of the paths. Information dictionaries are read in parallel; one that
-  /// cannot be read sets no flag.
-  std::vector<RegisteredApplication> applications(std::uint32_t mask, std::uint32_t value) override;
+  /// cannot be read sets no flag; for one that cannot be read for the moment the flag stands that it had. A
+  /// walk that such an error cuts short takes the place of none.
+  RegisteredApplications applications(std::uint32_t mask, std::uint32_t value) override;
 
   /// Scans in the background, then calls `done`, once, on a thread of the pool. A query that comes meanwhile
   /// waits, and scans again only when something may have changed since.
@@ -68,8 +69,9 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
   /// What one look at an application tells.
   struct Look {
     RememberedApplication application;
-    bool isSettled = false;  ///< any later change shows in the status
-    bool isLink = false;     ///< the information dictionary lies somewhere else
+    bool isSettled = false;    ///< any later change shows in the status
+    bool isLink = false;       ///< the information dictionary lies somewhere else
+    bool isTransient = false;  ///< it could not be read for the moment
   };
 
   /// What the last scan found, and what it takes to answer from that.
@@ -77,6 +79,7 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
     Applications applications;
     EventID position = 0;  ///< of the change log, before the scan; 0 when the scan does not answer for later
     std::vector<Outsider> outsiders;
+    bool isWhole = true;  ///< nothing was left out, or as it was, because of an error that may pass
   };
 
   struct Unwritten {
@@ -84,7 +87,7 @@ class LinuxApplicationRegistry final : public ApplicationRegistry {
     bool isWriting = false;  ///< some task looks for it
   };
 
-  Applications current();
+  Scan current();
   bool lastScanHolds() const KEL_RUNS_ON(scanning_);
   Scan scan() KEL_RUNS_ON(scanning_);
   ApplicationWalk walkRoots();

@@ -83,7 +83,7 @@ class LinuxApplicationsTest : public ScratchTest {
     LinuxApplicationRegistry registry(files, log, queue, {scratch / "b/", scratch / "a/", scratch / "none/"},
                                       std::nullopt, nullptr);
     std::vector<std::string> result;
-    for (const RegisteredApplication& application : registry.applications(flags, flags)) {
+    for (const RegisteredApplication& application : registry.applications(flags, flags).applications) {
       result.push_back(application.path.value().substr(scratch.path().size() + 1));
     }
     return result;
@@ -96,7 +96,7 @@ class LinuxApplicationsTest : public ScratchTest {
 TEST_F(LinuxApplicationsTest, UnusableInformationCountsAsEmptyAndIsLoggedOnceUnlessItIsMissing) {
   for (const std::string name : {"missing", "fifo", "device", "malformed", "huge"}) {
     const auto bundle = bundles.open(scratch / "a/" + name + ".app");
-    EXPECT_TRUE(bundle->informationDictionary().empty() && !bundle->identifier()) << name;
+    EXPECT_TRUE(bundle->information().dictionary.empty() && !bundle->identifier()) << name;
     const std::string line = "Cannot read the information dictionary " + scratch / "a/" + name + ".app/";
     EXPECT_THAT(log.take(),
                 testing::Conditional(name == "missing", IsEmpty(), ElementsAre(StartsWith(line))));

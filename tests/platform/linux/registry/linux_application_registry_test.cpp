@@ -41,7 +41,7 @@ struct LinuxApplicationRegistryTest : ScratchTest {
     std::vector<std::string> names;
     counted.reads = 0;
     counted.forgetUses();
-    for (const auto& each : registry.applications(~0U, ApplicationRegistry::providesServices))
+    for (const auto& each : registry.applications(~0U, ApplicationRegistry::providesServices).applications)
       names.push_back(std::filesystem::path(*each.path).stem());
     return names;
   }

@@ -21,7 +21,9 @@ TEST_F(ScratchTest, EveryLaunchEventStreamFiresAtTheStartAndForItsOwnChanges) {
   const std::string applications = scratch.makeDirectory("Applications") + "/";
   ConcurrentQueue pool;
   LinuxNotificationSeeds seeds(scratch / "run", log);
-  LinuxEventJournal journal({.applicationDirectories = {applications}}, files, log, pool);
+  JournalOptions options;
+  options.applicationDirectories = {applications};
+  LinuxEventJournal journal(options, files, log, pool);
   journal.watch({services});
   LinuxApplicationRegistry registry(files, log, pool, {applications}, scratch / "state", &journal);
   SerialQueue queue("handlers");
