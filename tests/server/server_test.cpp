@@ -298,14 +298,18 @@ class RunAsServerTest : public testing::Test {
   InMemoryPlatform system;
 };
 
-TEST_F(RunAsServerTest, SubscribesToItsStreamsInOrder) {
-  serve([this] {
+TEST_F(RunAsServerTest, ItsStreamsTellOfTheStartInTheirOrderBeforeTheFirstRequestAndOfChangesAfterwards) {
+  const auto postsAfterRequest = [this] {
+    ask(request("nonsense"));
+    return system.seeds.postsOf(seedName);
+  };
+  serve([&] {
     EXPECT_THAT(system.launchEvents.streams,
                 ElementsAre("com.orvex.beacond.matching", "com.orvex.broadcastd.matching",
                             "com.orvex.vigil.matching"));
+    EXPECT_EQ(postsAfterRequest(), 3U);
     system.launchEvents.fire.at("com.orvex.broadcastd.matching")();
-    ask(get);
-    EXPECT_GE(system.seeds.postsOf(seedName), 2U);
+    EXPECT_EQ(postsAfterRequest(), 4U);
   });
 }
 

@@ -109,17 +109,23 @@ class InMemorySeeds : public platform::NotificationSeeds {
   platform::Guarded<std::map<Token, Seed>> seeds_;
 };
 
-/// Streams that a test fires; the event at the start is left to the test.
+/// Streams that fire at the start and when a test says so.
 class InMemoryLaunchEvents : public platform::LaunchEvents {
  public:
   void setHandler(std::string_view stream, platform::SerialQueue& queue,
                   std::function<void()> handler) override {
     streams.emplace_back(stream);
-    fire[streams.back()] = [&queue, handler = std::move(handler)] { queue.async(handler); };
+    const auto found = fire.find(streams.back());
+    if (found == fire.end()) return;
+    found->second = [&queue, handler = std::move(handler)] { queue.async(handler); };
+    found->second();
   }
 
-  std::vector<std::string> streams;                   ///< in the order of their handlers
-  std::map<std::string, std::function<void()>> fire;  ///< queues the stream's handler
+  std::vector<std::string> streams;  ///< in the order of their handlers
+  /// By stream; each queues the handler.
+  std::map<std::string, std::function<void()>> fire{{"com.orvex.beacond.matching", {}},
+                                                    {"com.orvex.broadcastd.matching", {}},
+                                                    {"com.orvex.vigil.matching", {}}};
 };
 
 /// Applications that provide services.
