@@ -21,7 +21,7 @@ struct ConduitError {
   };
 
   Kind kind = Kind::Other;
-  std::string description;
+  std::string description;  ///< one line; "Connection invalid" or "Connection interrupted" for those kinds
 };
 
 /// The process at the other end of a connection, held so that a reused process id is not taken for it.

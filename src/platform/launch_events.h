@@ -23,8 +23,8 @@ class LaunchEvents {
   virtual ~LaunchEvents() = default;
 
   /// Runs `handler` on `queue` for every event of the stream, and once at the start: what changed while no
-  /// server ran is not told otherwise. One handler per stream; called before the main event loop is entered.
-  /// `queue` outlives this object.
+  /// server ran is not told otherwise. An unknown stream never fires. One handler per stream; called before
+  /// the main event loop is entered. `queue` outlives this object.
   virtual void setHandler(std::string_view stream, SerialQueue& queue, std::function<void()> handler) = 0;
 };
 

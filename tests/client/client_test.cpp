@@ -117,10 +117,21 @@ TEST_F(CommandLineTest, OddRepliesArePrintedAndChangeNoStatus) {
   reply = "text";
   EXPECT_THAT(run({"-flush"}),
               MatchesRegex("print_reply: unknown Conduit message type 0x[0-9a-f]+ for reply: text\n"));
+  EXPECT_EQ(status, 0);
+}
+
+TEST_F(CommandLineTest, WhatBreaksAConnectionIsPrintedAndLogged) {
+  EXPECT_EQ(run({"-dump"}), "Conduit message error: Connection invalid\n");
+  EXPECT_THAT(system.log.take(), ElementsAre("send_kel_payload: kel message error: Connection invalid"));
+  serve();
+  run({"-dump"});
+  EXPECT_THAT(system.log.take(), IsEmpty());
   reply.reset();
   EXPECT_EQ(run({"-update", "-flush"}),
             "Conduit message error: Connection interrupted\nConduit message error: Connection interrupted\n");
   EXPECT_EQ(status, 0);
+  const std::string line = "send_kel_payload: kel message error: Connection interrupted";
+  EXPECT_THAT(system.log.take(), ElementsAre(line, line));
 }
 
 }  // namespace

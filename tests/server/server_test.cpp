@@ -3,6 +3,7 @@
 #include <limits>
 
 #include "server/run_as_server.h"
+#include "support/conduit_ends.h"
 #include "support/in_memory_platform.h"
 #include "support/property_lists.h"
 
@@ -296,26 +297,22 @@ class RunAsServerTest : public testing::Test {
   /// What becomes of a client's request over a connection of its own, from the process `peer`.
   std::string ask(const Value& contents, std::int64_t peer = 1) {
     system.conduit.nextPeer = peer;
-    platform::SerialQueue queue("client");
-    const auto connection = system.conduit.connect(endpointName, queue);
-    connection->start();
-    const platform::ConduitReply reply = connection->sendAndWait(contents);
-    const auto* error = std::get_if<ConduitError>(&reply);
-    return error ? error->description : "answered";
+    const Value reply = SendingClient(system.conduit, endpointName).send(contents);
+    return reply.asDictionary() ? "answered" : *reply.asString();
   }
 
   InMemoryPlatform system;
 };
 
-TEST_F(RunAsServerTest, SubscribesToItsStreamsInOrder) {
-  serve([this] {
+TEST_F(RunAsServerTest, ItsStreamsTellOfTheStartInTheirOrderAndOfChangesAfterwards) {
+  serve([&] {
     EXPECT_THAT(system.launchEvents.streams,
                 ElementsAre("com.orvex.beacond.matching", "com.orvex.broadcastd.matching",
                             "com.orvex.vigil.matching"));
     system.launchEvents.fire.at("com.orvex.broadcastd.matching")();
-    ask(get);
+    ask(request("nonsense"));
   });
-  EXPECT_GE(system.seeds.postsOf(seedName), 2U);
+  EXPECT_EQ(system.seeds.postsOf(seedName), 4U);
 }
 
 TEST_F(RunAsServerTest, WhatASandboxedPeerIsRefusedCostsALogLineAndAFailedQuestionMeansNone) {

@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <deque>
 #include <functional>
+#include <iterator>
 #include <map>
 #include <memory>
 #include <optional>
@@ -126,17 +127,23 @@ class InMemorySeeds : public platform::NotificationSeeds {
   platform::Guarded<std::map<Token, Seed>> seeds_;
 };
 
-/// Streams that a test fires; the event at the start is left to the test.
+/// Streams that fire at the start and when a test says so.
 class InMemoryLaunchEvents : public platform::LaunchEvents {
  public:
   void setHandler(std::string_view stream, platform::SerialQueue& queue,
                   std::function<void()> handler) override {
     streams.emplace_back(stream);
-    fire[streams.back()] = [&queue, handler = std::move(handler)] { queue.async(handler); };
+    const auto found = fire.find(streams.back());
+    if (found == fire.end()) return;
+    found->second = [&queue, handler = std::move(handler)] { queue.async(handler); };
+    found->second();
   }
 
-  std::vector<std::string> streams;                   ///< in the order of their handlers
-  std::map<std::string, std::function<void()>> fire;  ///< queues the stream's handler
+  std::vector<std::string> streams;  ///< in the order of their handlers
+  /// By stream; each queues the handler.
+  std::map<std::string, std::function<void()>> fire{{"com.orvex.beacond.matching", {}},
+                                                    {"com.orvex.broadcastd.matching", {}},
+                                                    {"com.orvex.vigil.matching", {}}};
 };
 
 /// Applications that a test installs: those with services come first.
@@ -155,7 +162,7 @@ class InMemoryRegistry : public platform::ApplicationRegistry {
   std::atomic<std::size_t> queries = 0;
 };
 
-/// A journal in memory: replays what was recorded, and misbehaves on demand. One test thread arranges it.
+/// A journal in memory: tells what is recorded, and misbehaves on demand. One test thread arranges it.
 class InMemoryJournal : public platform::EventJournal {
  public:
   void watch(const std::vector<std::string>& directories) override { watchedDirectories = directories; }
@@ -166,66 +173,84 @@ class InMemoryJournal : public platform::EventJournal {
                                                         std::uint32_t flags) override {
     creations.push_back({since, flags});
     if (!available || (refuseWatchRoot && (flags & platform::stream_flags::watchRoot))) return nullptr;
-    std::vector<platform::JournalEvent> batch;
-    for (const platform::JournalEvent& event : events_) {
-      const bool watched = std::any_of(paths.begin(), paths.end(), [&](const std::string& path) {
-        return event.path.starts_with(path) || path.starts_with(event.path);
-      });
-      if (event.eventID > since && watched) batch.push_back(event);
-    }
-    if (historyEnds) batch.push_back({"", platform::event_flags::historyDone, newest_});
-    return std::make_unique<Stream>(*this, std::move(callback), std::move(batch));
+    return std::make_unique<Stream>(*this, std::move(callback), paths, since);
   }
 
-  /// Records an event at the next position.
+  /// Records an event at the next position, which running streams tell at once.
   void record(const std::string& path, std::uint32_t flags = 0) {
     events_.push_back({path, flags, ++newest_});
+    for (Stream* stream : running_) stream->tell({});
   }
 
   struct Creation {
     platform::EventID since = 0;
     std::uint32_t flags = 0;
   };
-  std::vector<std::string> watchedDirectories;       ///< what `watch` was told
-  std::vector<Creation> creations;                   ///< every stream asked for
-  std::vector<platform::JournalEvent> afterHistory;  ///< one more batch, delivered after history done
-  bool refuseWatchRoot = false;                      ///< no stream that watches its roots can be made
-  bool refuseStart = false;                          ///< streams are made but do not start
-  bool available = true;                             ///< streams can be made at all
-  bool historyEnds = true;                           ///< the replay comes to its end
+  std::vector<std::string> watchedDirectories;  ///< what `watch` was told
+  std::vector<Creation> creations;              ///< every stream asked for
+  bool refuseWatchRoot = false;                 ///< no stream that watches its roots can be made
+  bool refuseStart = false;                     ///< streams are made but do not start
+  bool available = true;                        ///< streams can be made at all
+  bool historyEnds = true;                      ///< the replay comes to its end
   std::atomic<int> liveStreams = 0;
 
  private:
   class Stream : public platform::JournalStream {
    public:
-    Stream(InMemoryJournal& journal, platform::JournalCallback callback,
-           std::vector<platform::JournalEvent> batch)
-        : journal_(journal), callback_(std::move(callback)), batch_(std::move(batch)) {
+    Stream(InMemoryJournal& journal, platform::JournalCallback callback, std::vector<std::string> paths,
+           platform::EventID since)
+        : journal_(journal), callback_(std::move(callback)), paths_(std::move(paths)), told_(since) {
       ++journal_.liveStreams;
     }
-    ~Stream() override { --journal_.liveStreams; }
+    ~Stream() override {
+      std::erase(journal_.running_, this);
+      --journal_.liveStreams;
+    }
 
     void setQueue(platform::SerialQueue& queue) override { queue_ = &queue; }
     bool start() override {
       if (journal_.refuseStart || !queue_) return false;
-      queue_->async([callback = callback_, batch = batch_] { callback(batch); });
-      if (!journal_.afterHistory.empty()) {
-        queue_->async([callback = callback_, later = journal_.afterHistory] { callback(later); });
-      }
+      journal_.running_.push_back(this);
+      std::vector<platform::JournalEvent> end;
+      if (journal_.historyEnds) end.push_back({"", platform::event_flags::historyDone, journal_.newest_});
+      tell(std::move(end));
       return true;
     }
-    void stop() override {}
-    void invalidate() override {}
+    void stop() override { *isClosed_ = true; }
+    void invalidate() override { *isClosed_ = true; }
+
+    /// What was recorded since the last time, and `further` events.
+    void tell(std::vector<platform::JournalEvent> further) {
+      const auto isWatched = [this](const platform::JournalEvent& event) {
+        return event.eventID > told_ && std::any_of(paths_.begin(), paths_.end(), [&](const auto& path) {
+                 return isIn(event.path, path) || isIn(path, event.path);
+               });
+      };
+      std::vector<platform::JournalEvent> batch;
+      std::copy_if(journal_.events_.begin(), journal_.events_.end(), std::back_inserter(batch), isWatched);
+      batch.insert(batch.end(), further.begin(), further.end());
+      told_ = journal_.newest_;
+      queue_->async([isClosed = isClosed_, callback = callback_, batch = std::move(batch)] {
+        if (!*isClosed) callback(batch);
+      });
+    }
 
    private:
+    static bool isIn(const std::string& path, const std::string& directory) {
+      return platform::joinPath(path, "").starts_with(platform::joinPath(directory, ""));
+    }
+
     InMemoryJournal& journal_;
     const platform::JournalCallback callback_;
-    const std::vector<platform::JournalEvent> batch_;
+    const std::vector<std::string> paths_;
+    platform::EventID told_;
     platform::SerialQueue* queue_ = nullptr;
+    const std::shared_ptr<std::atomic<bool>> isClosed_ = std::make_shared<std::atomic<bool>>(false);
   };
 
   platform::EventID newest_ = 1000;
   std::vector<platform::JournalEvent> events_;
+  std::vector<Stream*> running_;
 };
 
 /// A process whose main loop runs a test's work and then returns.
