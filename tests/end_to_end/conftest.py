@@ -90,9 +90,9 @@ class Home:
         }  # fmt: skip
         self.server = None
 
-    def put_bundle(self, name, title):
-        path = self.home / "Library" / "Services" / name
-        path.mkdir(parents=True)
+    def put_bundle(self, name, title, directory="Library/Services"):
+        path = self.home / directory / name
+        path.mkdir(parents=True, exist_ok=True)
         declared = {"QVMessage": "go", "QVMenuItem": {"default": title}}
         (path / "Info.plist").write_bytes(encode({"KTBundleIdentifier": f"org.example.{name}", "QVServices": [declared]}))
 
@@ -103,9 +103,6 @@ class Home:
     def start(self, **options):
         with open(self.log_path, "ab") as log:
             self.server = self.spawn(stderr=log, **options)
-        self.await_server()
-
-    def await_server(self):
         wait_until(self.connects, "the server")
 
     def connects(self):

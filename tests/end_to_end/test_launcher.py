@@ -55,7 +55,7 @@ def test_the_launcher_hears_of_readiness_and_then_how_many_transactions_are_open
             return reports[-1:]
 
         activate(home, listen=["--listen", str(home.endpoint)])
-        home.await_server()
+        wait_until(home.connects, "the server")
         idle = ["STATUS=0 open transactions"]
         wait_until(lambda: home.ask(UPDATE) and last() not in ([], idle) and len(reports) > 1, "open transactions")
         wait_until(lambda: last() == idle, "the end of the work")

@@ -82,13 +82,3 @@ def test_a_restarted_server_answers_from_the_cache_file(served):
     assert served.ask(GET)["data"] == before
     status, printed = served.client("-dump_cache")
     assert status == 0 and "loc_to_menu_strings = {" in printed
-
-
-def test_a_mock_registry_change_bumps_the_seed(served):
-    def seeds():
-        return {path.name: path.read_bytes() for path in (served.run / "kel" / "beacond").glob("*qvservices.seed*")}
-
-    served.services()  # clears what became stale before, so that the next change counts
-    before = seeds()
-    assert before and served.client("-mockar") == (0, "Mocking complete\n")
-    wait_until(lambda: seeds() != before, "another seed")
