@@ -33,8 +33,8 @@ def encode(message):
     return plistlib.dumps(message, fmt=plistlib.FMT_BINARY)
 
 
-def frame(payload, kind=REQUEST, tag=7, length=None):
-    return struct.pack(">IIQ", len(payload) if length is None else length, kind, tag) + payload
+def frame(payload, tag=7):
+    return struct.pack(">IIQ", len(payload), REQUEST, tag) + payload
 
 
 class Peer:

@@ -2,8 +2,6 @@
 
 import concurrent.futures
 import os
-import plistlib
-import random
 import select
 import signal
 import socket
@@ -61,22 +59,3 @@ def test_the_termination_signal_ends_the_server_with_status_0(crowded, busy):
         while peer.receive():
             pass
     assert crowded.client("-dump") == (0, "Conduit message error: Connection invalid\n")
-
-
-def test_kill_at_any_time_leaves_a_readable_cache_or_none(crowded):
-    chance = random.Random(7)
-    for _ in range(15):
-        peer = crowded.connect()
-        peer.socket.sendall(b"".join(frame(encode(UPDATE), tag=tag) for tag in range(1, 5)))
-        peer.socket.settimeout(chance.uniform(0.001, 0.06))
-        try:
-            peer.receive()  # however far the updates come until then
-        except TimeoutError:
-            pass
-        crowded.stop(signal.SIGKILL)
-        if cached := crowded.cached():
-            assert len(plistlib.loads(cached)["ServicesCache"]) == MANY
-        crowded.start()
-        assert len(crowded.services()) in (0, MANY)
-    crowded.ask(UPDATE)
-    assert len(crowded.services()) == MANY
