@@ -14,8 +14,7 @@ namespace {
 
 using namespace std::string_literals;
 using namespace test;
-using testing::Optional;
-using testing::UnorderedElementsAre;
+using namespace testing;
 
 struct InMemoryWorld : InMemoryPlatform {
   void install(const std::string& name, bool withServices) {
