@@ -229,7 +229,7 @@ class RunAsServerTest : public testing::Test {
     EXPECT_EQ(run_as_server(system.platform), 0);
   }
 
-  /// What becomes of a request over a connection of its own, from the process `peer`.
+  /// What becomes of a client's request over a connection of its own, from the process `peer`.
   std::string ask(const Value& contents, std::int64_t peer = 1) {
     system.conduit.nextPeer = peer;
     platform::SerialQueue queue("client");
