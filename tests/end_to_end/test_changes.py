@@ -1,9 +1,8 @@
 """Changes on disk reach clients that only wait for the seed and ask again, as applications do."""
 
 import shutil
-import time
 
-from conftest import GET, wait_until
+from conftest import wait_until
 
 
 class Watcher:
@@ -16,15 +15,6 @@ class Watcher:
     def seeds(self):
         return {path.name: path.read_bytes() for path in (self.home.run / "kel" / "beacond").glob("*qvservices.seed*")}
 
-    def settle(self):
-        """Asks until nothing from the start can move the seed any more: reactions are six seconds apart at most."""
-        quiet_since = time.monotonic()
-        while time.monotonic() < quiet_since + 7:
-            if self.seeds() != self.seen:
-                self.seen, quiet_since = self.seeds(), time.monotonic()
-                self.home.ask(GET)
-            time.sleep(0.02)
-
     def titles_after_seed(self):
         wait_until(lambda: self.seeds() != self.seen, "the seed to move")
         self.seen = self.seeds()
@@ -34,29 +24,20 @@ class Watcher:
         wait_until(lambda: there <= (titles := self.titles_after_seed()) and not gone & titles, what)
 
 
-def test_a_change_moves_the_seed_and_the_second_answer_holds_it(served):
+def test_bundles_and_applications_are_followed_and_so_is_what_a_link_leads_to(served):
     watcher = Watcher(served)
-    watcher.settle()
-    before = set(served.titles())
-    (served.home / "Library" / "Services" / "Word Count.service").rename(served.root / "elsewhere")
-    assert watcher.titles_after_seed() == before  # the old list, which is rebuilt now
-    assert watcher.titles_after_seed() == before - {"Count Words"}
     served.put_bundle("new.service", "Brand New")
-    watcher.follow_until("the new bundle", {"Brand New"})
-    served.put_bundle("new.service", "Edited")
-    watcher.follow_until("the edited bundle", {"Edited"}, {"Brand New"})
-
-
-def test_applications_are_followed_and_so_is_what_a_link_leads_to(served):
-    watcher = Watcher(served)
     served.put_bundle("Fresh.app", "Fresh", "Applications/Tools")
     served.put_bundle("linked", "Linked", "elsewhere")
     (served.home / "Applications" / "Linked.app").symlink_to(served.home / "elsewhere" / "linked")
-    watcher.follow_until("the new applications", {"Fresh", "Linked"})
+    watcher.follow_until("the new bundles", {"Brand New", "Fresh", "Linked"})
+    served.put_bundle("new.service", "Edited")
+    watcher.follow_until("the edited bundle", {"Edited"}, {"Brand New"})
     served.put_bundle("linked", "Changed", "elsewhere")
     watcher.follow_until("the changed link target", {"Changed"}, {"Linked"})
+    (served.home / "Library" / "Services" / "Word Count.service").rename(served.root / "elsewhere")
     shutil.rmtree(served.home / "Applications" / "Tools")
-    watcher.follow_until("the removed application", set(), {"Fresh"})
+    watcher.follow_until("what was removed", set(), {"Count Words", "Fresh"})
 
 
 def test_what_changed_while_no_server_ran_is_found_without_being_asked_for(served):
