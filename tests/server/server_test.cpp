@@ -104,10 +104,13 @@ TEST_F(ServerTest, WhatIsAtHandIsAnsweredAtOnceAndRebuildsWaitAndAreDoneOnceUnle
   EXPECT_THAT(server->knownLoadedLocalizations(), ElementsAre("de"));
   EXPECT_TRUE(send(localizations({"de", "xx"}))->isThere());
   EXPECT_TRUE(send(localizations({}))->isThere());
+  send(request("flush"));
+  const Answer afterFlush = send(debugUpdate);
   gate.signal();
   EXPECT_EQ(menuItem(listIn(translated), 0), dictionary({{"default", "One"}, {"de", "Eins"}}));
   EXPECT_EQ(debugOutput(coalesced), "Coalescing Services update (gen counts were 1/3");
   EXPECT_EQ(menuItem(listIn(coalesced), 0), menuItem(listIn(translated), 0));
+  EXPECT_THAT(debugOutput(afterFlush), StartsWith("Updating Services cache"));
 }
 
 TEST_F(ServerTest, AFlushIsAnsweredWithoutDataAndOutlivesARebuildThatWasUnderWay) {
