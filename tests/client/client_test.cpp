@@ -7,10 +7,7 @@
 namespace kel::test {
 namespace {
 
-using platform::ConduitConnection;
-using platform::ConduitError;
-using platform::ConduitEvent;
-using platform::ConduitMessage;
+using namespace platform;
 
 TEST(ClassificationTest, TellsKindsApartByNameAndElseAndOnlyABooleanTrueAsksForDebugOutput) {
   using enum KELCommand;
@@ -32,8 +29,7 @@ TEST(ClassificationTest, TellsKindsApartByNameAndElseAndOnlyABooleanTrueAsksForD
     EXPECT_EQ(wants_debug(dictionary({{"debug", value}})), value == Value(true));
 }
 
-class CommandLineTest : public testing::Test {
- protected:
+struct CommandLineTest : testing::Test {
   /// Answers every request with `reply` and keeps it.
   void serve() {
     listening = system.conduit.listen(endpointName, serverQueue, [this](const ConduitEvent& event) {
@@ -61,8 +57,8 @@ class CommandLineTest : public testing::Test {
   const std::string usage =
       "Usage: kel [-debug] [-dump] [-dump_cache] [-update] [-flush] language1 language2...\n";
   InMemoryPlatform system;
-  platform::SerialQueue serverQueue{"server"};
-  platform::ConduitListening listening;
+  SerialQueue serverQueue{"server"};
+  ConduitListening listening;
   std::vector<Value> requests;
   std::optional<Value> reply = dictionary({});
   int status = -1;

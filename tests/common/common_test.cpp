@@ -33,9 +33,8 @@ TEST(DebugSinkTest, ASinkBelongsToItsThreadAndParallelWorkersShareTheCallers) {
     });
   });
   EXPECT_EQ(lines.size(), elements.size() * 21 - 1) << lines;
-  for (const int element : elements) {
+  for (const int element : elements)
     EXPECT_NE(lines.find(std::string(20, static_cast<char>('0' + element))), std::string::npos) << lines;
-  }
 }
 
 TEST(PathSetTest, AnswersLikeAWalkOverAllElements) {

@@ -19,8 +19,7 @@ std::string lines(const std::function<void()>& work) {
   return std::regex_replace(debugLines(work), std::regex("<KELAppEntry: [^>]*>"), "<entry>");
 }
 
-class DataStoreTest : public testing::Test {
- protected:
+struct DataStoreTest : testing::Test {
   DataStoreTest() {
     addService("one", "One");
     addService("two", "Two");

@@ -50,8 +50,7 @@ TEST(PathsToObserveTest, ThreeNeighboursAreWatchedThroughTheirDirectoryAndNothin
     EXPECT_EQ(parent_directory(path), parent) << path;
 }
 
-class PathChangesObserverTest : public testing::Test {
- protected:
+struct PathChangesObserverTest : testing::Test {
   /// Observes and returns the debug lines; afterwards no stream is open.
   std::string observe(const Paths& paths) {
     std::string lines = debugLines([&] { observer.observeChangesUnderPaths(paths); });

@@ -12,8 +12,7 @@ namespace {
 using platform::Bytes;
 
 /// A platform, one bundle and its entry.
-class AppEntryTest : public testing::Test {
- protected:
+struct AppEntryTest : testing::Test {
   AppEntryTest() { addBundle(system.files, path, information); }
 
   std::shared_ptr<KELAppEntry> entryAt(const std::string& bundlePath) {
@@ -147,8 +146,7 @@ TEST_F(AppEntryTest, DirectoryThenBootVolumeThenPathLengthDecideBetweenCopies) {
   EXPECT_TRUE(wins("/x/\U0001F600.app", "/x/ab.app") && wins("/x/ab.app", "/x/\U0001F600.app"));
 }
 
-class NormalisationTest : public AppEntryTest {
- protected:
+struct NormalisationTest : AppEntryTest {
   /// The public form without what every service has.
   Dictionary rest(Entries declared, Value tables = Dictionary()) {
     const auto services = publicServices(*cached({{"service_dicts", Array{dictionary(std::move(declared))}},
@@ -273,8 +271,7 @@ TEST_F(NormalisationTest, ValueThatCannotBeHandledCostsTheRestOfTheEntryOnly) {
   }
 }
 
-class ValidationTest : public AppEntryTest {
- protected:
+struct ValidationTest : AppEntryTest {
   /// The messages about an entry with these fields, each on a line; the verdict must agree with them, with
   /// and without logging.
   std::string problems(Entries fields) {

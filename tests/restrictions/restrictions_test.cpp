@@ -76,8 +76,7 @@ TEST(RestrictionListsTest, FileIsReadAnewFromTheLastSystemLibraryDirectory) {
   EXPECT_FALSE(load()) << "no library directory";
 }
 
-class WhitelistGeneratorTest : public testing::Test {
- protected:
+struct WhitelistGeneratorTest : testing::Test {
   void publish(Array services) {
     system.publication.publish(dictionary({{"KTVendedServices", std::move(services)}}));
   }

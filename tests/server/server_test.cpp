@@ -21,8 +21,7 @@ const Value update = request("get_and_update_services_plist");
 const Value debugUpdate = dictionary({{"command", "get_and_update_services_plist"}, {"debug", true}});
 Value localizations(Array names) { return dictionary({{"localizations", std::move(names)}}); }
 
-class ServerTest : public testing::Test {
- protected:
+struct ServerTest : testing::Test {
   using Answer = std::shared_ptr<InMemoryMessage::Answer>;
 
   ServerTest() {
@@ -174,8 +173,7 @@ TEST(ServerSeedTest, IsKeptDrawnAtRandomAndNeverZero) {
   EXPECT_EQ(seed(fresh), 0xabcd00001235U);
 }
 
-class ReactorTest : public ServerTest {
- protected:
+struct ReactorTest : ServerTest {
   /// What a request does with the flags: it clears them.
   void clearFlags() {
     perform(get);
@@ -224,8 +222,7 @@ TEST_F(ReactorTest, SeedingCompleteIsToldEveryTimeAndTheNextRequestAsksTheRegist
   EXPECT_EQ(system.registry.queries, queries + 1);
 }
 
-class RunAsServerTest : public testing::Test {
- protected:
+struct RunAsServerTest : testing::Test {
   /// Runs the server with `work` as its main loop.
   void serve(platform::Task work) {
     system.process.mainLoop = std::move(work);

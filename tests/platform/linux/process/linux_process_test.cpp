@@ -101,9 +101,8 @@ OwnedDescriptor daemonAt(const std::string& name) {
 std::vector<std::string> received(const OwnedDescriptor& daemon) {
   std::vector<std::string> messages;
   char buffer[65536];
-  for (ssize_t length = 0; (length = recv(daemon.get(), buffer, sizeof buffer, MSG_DONTWAIT)) >= 0;) {
+  for (ssize_t length = 0; (length = recv(daemon.get(), buffer, sizeof buffer, MSG_DONTWAIT)) >= 0;)
     messages.emplace_back(buffer, static_cast<std::size_t>(length));
-  }
   return messages;
 }
 
