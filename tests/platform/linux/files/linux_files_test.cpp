@@ -55,9 +55,8 @@ TEST_F(ScratchTest, APrivateDirectoryIsOneThatNobodyElseCanWriteTo) {
   umask(before);
   EXPECT_EQ(scratch.mode("kel"), 0700U);
   ASSERT_EQ(symlink(path.c_str(), (scratch / "link").c_str()), 0);
-  for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"}) {
+  for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"})
     EXPECT_EQ(makePrivateDirectory(wrong).path, std::nullopt) << wrong;
-  }
   chmod(path.c_str(), 0720);
   EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("kel: others may write to it"));
   if (geteuid() == 0 && chown(path.c_str(), 12345, 12345) == 0) {
