@@ -33,9 +33,8 @@ TEST(DebugSinkTest, ASinkBelongsToItsThreadAndParallelWorkersShareTheCallers) {
     });
   });
   EXPECT_EQ(lines.size(), elements.size() * 21 - 1) << lines;
-  for (const int element : elements) {
+  for (const int element : elements)
     EXPECT_NE(lines.find(std::string(20, static_cast<char>('0' + element))), std::string::npos) << lines;
-  }
 }
 
 TEST(PathSetTest, AnswersLikeAWalkOverAllElements) {
@@ -49,16 +48,14 @@ TEST(PathSetTest, AnswersLikeAWalkOverAllElements) {
     PathSet set;
     std::set<std::string> model;
     for (int step = 0; step < 12; ++step) {
-      const std::string inserted = randomPath();
-      set.insert(inserted);
-      model.insert(inserted);
+      set.insert(*model.insert(randomPath()).first);
       const std::string path = randomPath();
-      const bool holdsPrefix = std::any_of(
-          model.begin(), model.end(), [&](const std::string& element) { return path.starts_with(element); });
-      std::set<std::string> under;
-      std::copy_if(model.begin(), model.end(), std::inserter(under, under.end()),
-                   [&](const std::string& element) { return element.starts_with(path); });
-      std::set<std::string> found;
+      bool holdsPrefix = false;
+      std::set<std::string> under, found;
+      for (const std::string& element : model) {
+        holdsPrefix |= path.starts_with(element);
+        if (element.starts_with(path)) under.insert(element);
+      }
       set.addElementsUnder(path, found);
       ASSERT_EQ(set.holdsPrefixOf(path), holdsPrefix) << path << " in " << testing::PrintToString(model);
       ASSERT_EQ(found, under) << path;

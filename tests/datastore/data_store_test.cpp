@@ -14,31 +14,29 @@ const std::string services = "/home/u/Library/Services/";
 const std::string one = services + "one.service";
 const std::string two = services + "two.service";
 
-std::unique_ptr<KELDataStore> makeStore(InMemoryPlatform& system) {
-  return KELDataStore::initWithSystemServices(system.platform);
-}
-
-Names titles(KELDataStore& store) { return defaultTitles(store.currentPublicDictionaries()); }
-
 /// Debug lines without the entries' addresses.
 std::string lines(const std::function<void()>& work) {
   return std::regex_replace(debugLines(work), std::regex("<KELAppEntry: [^>]*>"), "<entry>");
 }
 
-class DataStoreTest : public testing::Test {
- protected:
+struct DataStoreTest : testing::Test {
   DataStoreTest() {
-    addBundle(system.files, one, information("org.a.one", "One"));
-    addBundle(system.files, two, information("org.a.two", "Two"));
+    addService("one", "One");
+    addService("two", "Two");
     addApplication("/Applications/App.app", information("org.a.app", "App"));
     system.files.addPropertyList(restrictionsPath, dictionary({}));
+    restart();
   }
 
+  void restart() { store = KELDataStore::initWithSystemServices(system.platform); }
+  void addService(const std::string& name, const std::string& title) {
+    addBundle(system.files, services + name + ".service", information("org.a." + name, title));
+  }
   void addApplication(const std::string& path, const Dictionary& declared) {
     addBundle(system.files, path, declared);
     system.registry.registered.push_back({path});
   }
-
+  Names titles() { return defaultTitles(store->currentPublicDictionaries()); }
   std::string update(KELStaleCacheFlags flags) {
     return lines([&] { store->updateServicesCache(flags); });
   }
@@ -51,28 +49,29 @@ class DataStoreTest : public testing::Test {
       store.reset();
     });
   }
-
   Dictionary cacheFile() {
     return *platform::readDictionaryFile(system.files, cachePath, platform::largestOwnFile).dictionary;
   }
 
   InMemoryPlatform system;
-  std::unique_ptr<KELDataStore> store = makeStore(system);
+  std::unique_ptr<KELDataStore> store;
 };
 
 TEST_F(DataStoreTest, TheFirstUpdateReadsEverySourceAndSaysSo) {
   const std::string told = update(0);
-  EXPECT_THAT(told, HasSubstr("Loading cache from " + cachePath + "\nCache at " + cachePath +
-                              " came back nil (file does NOT exist)\nCache contains 0 keys\n"
-                              "0 path(s) from AppRegistry"));
-  EXPECT_THAT(told, HasSubstr("Service providing paths:\n\t/Applications/App.app"));
-  EXPECT_THAT(told, HasSubstr("Scanning directory: " + services));
-  EXPECT_THAT(told, HasSubstr("Scanning directory: /OrvexInternal/Applications/"));
-  EXPECT_THAT(told, HasSubstr("Creating entry <entry> for path /Applications/App.app"));
-  EXPECT_THAT(titles(*store), ElementsAre("App", "One", "Two"));
+  for (const std::string& part :
+       {"Loading cache from " + cachePath + "\nCache at " + cachePath +
+            " came back nil (file does NOT exist)\nCache contains 0 keys\n0 path(s) from AppRegistry",
+        std::string("Service providing paths:\n\t/Applications/App.app"), "Scanning directory: " + services,
+        std::string("Scanning directory: /OrvexInternal/Applications/"),
+        std::string("Creating entry <entry> for path /Applications/App.app")})
+    EXPECT_THAT(told, HasSubstr(part));
+  EXPECT_THAT(titles(), ElementsAre("App", "One", "Two"));
   EXPECT_EQ(lines([&] { store->fetchLocalizations(std::nullopt); }), "");
-  const std::string fetched = lines([&] { store->fetchLocalizations(Names{"French", "German"}); });
-  EXPECT_THAT(fetched, StartsWith("Fetching localization(s): French, German"));
+  EXPECT_THAT(lines([&] {
+                store->fetchLocalizations(Names{"French", "German"});
+              }),
+              StartsWith("Fetching localization(s): French, German"));
 }
 
 TEST_F(DataStoreTest, ARestartFromTheCacheListsNoDirectoryOpensNoBundleAndGivesTheSameList) {
@@ -82,7 +81,7 @@ TEST_F(DataStoreTest, ARestartFromTheCacheListsNoDirectoryOpensNoBundleAndGivesT
   system.files.forgetUses();
   const int opens = system.bundles.opens;
 
-  store = makeStore(system);
+  restart();
   EXPECT_TRUE(store->cacheIsFromThisBootSession());
   EXPECT_EQ(store->currentPublicDictionaries(), list);
   EXPECT_THAT(update(KELStaleServiceDirectories), HasSubstr("No changes!\nCache valid for directory "));
@@ -94,11 +93,11 @@ TEST_F(DataStoreTest, ARestartFromTheCacheListsNoDirectoryOpensNoBundleAndGivesT
 TEST_F(DataStoreTest, TheCacheFileHoldsExactlyItsKeysAndSurvivesAFailedWrite) {
   EXPECT_THAT(writeCache(), MatchesRegex("Wrote out cache file \\([0-9]+ bytes\\)"));
   const Dictionary cache = cacheFile();
-  Names keys;
-  for (const auto& [key, value] : cache) keys.push_back(key.text());
-  EXPECT_THAT(keys, ElementsAre("QVServicesARPaths", "QVServicesBuildVersion",
-                                "QVServicesExplicitDirectoryCache", "QVServicesLastEventID",
-                                "QVServicesRestrictionLists", "QVServicesSessionID", "ServicesCache"));
+  std::string keys;
+  for (const auto& [key, value] : cache) keys += key.text() + " ";
+  EXPECT_EQ(keys,
+            "QVServicesARPaths QVServicesBuildVersion QVServicesExplicitDirectoryCache "
+            "QVServicesLastEventID QVServicesRestrictionLists QVServicesSessionID ServicesCache ");
   EXPECT_EQ(*cache.find("QVServicesSessionID"), "1700000000,100004");
   EXPECT_EQ(*cache.find("QVServicesLastEventID"), 1000);
   EXPECT_EQ(*cache.find("QVServicesARPaths"), (Array{"/Applications/App.app"}));
@@ -106,10 +105,12 @@ TEST_F(DataStoreTest, TheCacheFileHoldsExactlyItsKeysAndSurvivesAFailedWrite) {
   EXPECT_EQ(system.transactions.openCount, 0);
 
   system.files.failNextWrite("Disk full");
-  EXPECT_EQ(debugLines([&] { makeStore(system)->writeCaches(); }), "Failed to write cache file: Disk full");
+  restart();
+  EXPECT_EQ(debugLines([&] { store->writeCaches(), store.reset(); }),
+            "Failed to write cache file: Disk full");
   EXPECT_EQ(cacheFile(), cache);
 
-  store = makeStore(system);
+  restart();
   system.files.removeTree(restrictionsPath);
   store->writeCaches();
   store->flushCaches();
@@ -134,26 +135,28 @@ TEST_F(DataStoreTest, ADamagedOrForeignCacheIsLeftOutAsFarAsItIsWrong) {
              {"ServicesCache", Array{}}},
             "Cache contains 5 keys\n0 path(s) from AppRegistry"}}) {
     system.files.addPropertyList(cachePath, dictionary(fields));
-    const auto own = makeStore(system);
-    EXPECT_THAT(lines([&] { own->loadCache(); }), HasSubstr(expected));
-    EXPECT_FALSE(own->cacheIsFromThisBootSession()) << expected;
-    EXPECT_THAT(titles(*own), IsEmpty()) << expected;
+    restart();
+    EXPECT_THAT(lines([&] { store->loadCache(); }), HasSubstr(expected));
+    EXPECT_FALSE(store->cacheIsFromThisBootSession()) << expected;
+    EXPECT_THAT(titles(), IsEmpty()) << expected;
   }
   system.files.addText(cachePath, "bplist00 but no more");
-  EXPECT_THAT(lines([&] { makeStore(system)->loadCache(); }), HasSubstr("came back nil (file does exist)"));
+  restart();
+  EXPECT_THAT(lines([&] { store->loadCache(); }), HasSubstr("came back nil (file does exist)"));
 }
 
 TEST_F(DataStoreTest, TheBootSessionIsKeptForTheProcessAndComparedWithTheCache) {
   writeCache();
-  const auto sameSystemLater = [&](auto change) {
+  using Row = std::tuple<std::int64_t, std::int64_t, bool>;
+  for (const auto& [boot, session, isSame] :
+       {Row{1700000000, 100004, true}, Row{1700000001, 100004, false}, Row{1700000000, -1, false}}) {
     InMemoryPlatform later;
     later.files.addFile(cachePath, system.files.contents(cachePath).value());
-    change(later.facts);
-    return makeStore(later)->cacheIsFromThisBootSession();
-  };
-  EXPECT_TRUE(sameSystemLater([](auto&) {}));
-  EXPECT_FALSE(sameSystemLater([](InMemoryFacts& facts) { facts.boot.value = 1700000001; }));
-  EXPECT_FALSE(sameSystemLater([](InMemoryFacts& facts) { facts.session.value = -1; }));
+    later.facts.boot.value = boot;
+    later.facts.session.value = session;
+    const auto own = KELDataStore::initWithSystemServices(later.platform);
+    EXPECT_EQ(own->cacheIsFromThisBootSession(), isSame) << boot;
+  }
 
   InMemoryPlatform broken;
   broken.facts.boot = {std::nullopt, 2, "No such file or directory"};
@@ -167,118 +170,98 @@ TEST_F(DataStoreTest, TheBootSessionIsKeptForTheProcessAndComparedWithTheCache) 
   EXPECT_EQ(identity, "0,0");
 }
 
-TEST_F(DataStoreTest, FlagsSayWhichSourcesAreReadAgainAndAFlushKeepsTheRegistry) {
+TEST_F(DataStoreTest, FlagsAndTheJournalSayWhatIsReadAgainAndAFlushKeepsTheRegistry) {
+  const auto uses = [&](const std::string& path) { return system.files.uses(path); };
   update(KELStaleEverything);
   system.files.forgetUses();
   const std::size_t queries = system.registry.queries;
   addApplication("/Applications/New.app", information("org.a.new", "New"));
-  addBundle(system.files, services + "three.service", information("org.a.three", "Three"));
+  addService("three", "Three");
+  addService("two", "Changed");
   system.journal.record(services + "three.service/Info.plist");
 
-  update(0);
-  EXPECT_THAT(titles(*store), ElementsAre("App", "One", "Two"));
-  EXPECT_TRUE(system.journal.creations.empty());
-  update(8 | 16);
-  EXPECT_EQ(system.registry.queries, queries);
+  update(8 | 16);  // which name no source
+  EXPECT_THAT(titles(), ElementsAre("App", "One", "Two"));
+  EXPECT_TRUE(system.registry.queries == queries && system.journal.creations.empty());
   update(KELStaleAppRegistryPaths);
-  EXPECT_THAT(titles(*store), ElementsAre("App", "New", "One", "Two"));
-  EXPECT_EQ(system.files.uses(services), 0U);
+  EXPECT_THAT(titles(), ElementsAre("App", "New", "One", "Two"));
+  EXPECT_EQ(uses(services), 0U);
   update(KELStaleServiceDirectories);
-  EXPECT_THAT(titles(*store), ElementsAre("App", "New", "One", "Three", "Two"));
-  EXPECT_EQ(system.files.uses(one + "/Info.plist"), 0U);
+  EXPECT_THAT(titles(), ElementsAre("App", "New", "One", "Three", "Two"));
   EXPECT_EQ(system.journal.creations.back().since, 1000U);
+  system.files.forgetUses();
+  system.journal.record(two + "/Info.plist");
   update(KELStaleServiceDirectories);
+  EXPECT_THAT(titles(), ElementsAre("App", "New", "One", "Three", "Changed"));
+  EXPECT_THAT(Array({uses(services), uses(one + "/Info.plist"), uses(two + "/Info.plist")}),
+              ElementsAre(0, 0, 1));
   EXPECT_EQ(system.journal.creations.back().since, 1001U) << "resumes where the last update began";
+  system.journal.available = false;
+  EXPECT_THAT(update(KELStaleServiceDirectories), HasSubstr("VigilStream failed!"));
+  EXPECT_EQ(uses(services) + uses(one + "/Info.plist"), 2U);
   store->flushCaches();
   EXPECT_THAT(update(0), HasSubstr("Scanning directory: " + services));
   EXPECT_EQ(system.registry.queries, queries + 1);
 }
 
-TEST_F(DataStoreTest, AChangeInsideAKnownBundleReloadsThatBundleUnlessTheJournalFails) {
-  update(KELStaleEverything);
-  system.files.forgetUses();
-  addBundle(system.files, two, information("org.a.two", "Changed"));
-  system.journal.record(two + "/Info.plist");
-  update(KELStaleServiceDirectories);
-  EXPECT_THAT(titles(*store), ElementsAre("App", "One", "Changed"));
-  EXPECT_EQ(system.files.uses(two + "/Info.plist"), 1U);
-  EXPECT_EQ(system.files.uses(one + "/Info.plist"), 0U);
-  EXPECT_EQ(system.files.uses(services), 0U);
-
-  system.journal.available = false;
-  EXPECT_THAT(update(KELStaleServiceDirectories), HasSubstr("VigilStream failed!"));
-  EXPECT_EQ(system.files.uses(services), 1U);
-  EXPECT_EQ(system.files.uses(one + "/Info.plist"), 1U);
-}
-
-TEST_F(DataStoreTest, BundlesThatVanishOrStopLoadingDropOutAndAreTriedAgain) {
+TEST_F(DataStoreTest, ABundleThatStopsLoadingDropsOutAndIsTriedAgain) {
   update(KELStaleEverything);
   addBundle(system.files, one, dictionary({{"KTBundleName", 5}}));
-  system.files.removeTree(two);
-  for (const std::string& changed : {one + "/Info.plist", two, services + "."})
-    system.journal.record(changed);
+  system.journal.record(one + "/Info.plist");
   update(KELStaleServiceDirectories);
-  EXPECT_THAT(titles(*store), ElementsAre("App"));
+  EXPECT_THAT(titles(), ElementsAre("App", "Two"));
   EXPECT_THAT(system.log.take(), ElementsAre(HasSubstr("Malformed Services entries in Info.plist")));
-  addBundle(system.files, one, information("org.a.one", "Mended"));
+  addService("one", "Mended");
   EXPECT_THAT(update(0), HasSubstr("Creating entry <entry> for path " + one));
-  EXPECT_THAT(titles(*store), ElementsAre("App", "Mended"));
+  EXPECT_THAT(titles(), ElementsAre("App", "Mended", "Two"));
 }
 
 TEST_F(DataStoreTest, CopiesAreDecidedArchivesSkippedAndEntriesWithoutIdentifierSortAsNull) {
   addApplication("/B/Old.tqarchive/X.app", information("org.a.x", "X"));
   addApplication("/Applications/Copy of One.app", information("org.a.one", "Loser"));
   for (const std::string identifier : {"!first", "0digit"})
-    addBundle(system.files, services + identifier + ".service", information(identifier, identifier));
+    addBundle(system.files, services + identifier, information(identifier, identifier));
   const Array nameless{service("Nameless"), service("Also nameless")};
   addBundle(system.files, services + "nameless.service", dictionary({{"QVServices", nameless}}));
-  const std::string told = debugLines([&] {
-    store->updateServicesCache(KELStaleEverything);
-    EXPECT_THAT(titles(*store),
-                ElementsAre("!first", "Nameless", "Also nameless", "0digit", "App", "One", "Two"));
-  });
+  const std::string told = update(KELStaleEverything);
   EXPECT_THAT(told, HasSubstr("Skipping file inside .tqarchive: /B/Old.tqarchive/X.app"));
-  EXPECT_THAT(told, HasSubstr("Collision resolution: preferring " + one +
-                              " to /Applications/Copy of One.app due to directory precedence"));
+  EXPECT_THAT(titles(), ElementsAre("!first", "Nameless", "Also nameless", "0digit", "App", "One", "Two"));
+  EXPECT_THAT(debugLines([&] { store->uniquedAppEntries(); }),
+              HasSubstr("Collision resolution: preferring " + one +
+                        " to /Applications/Copy of One.app due to directory precedence"));
 }
 
 TEST_F(DataStoreTest, SpellCheckersSurviveOnlyWhereTheyMayLive) {
-  const auto spellChecker = [](const std::string& title) {
-    DictionaryBuilder declared(service(title));
-    declared.set("QVSpellChecker", "checker");
-    return Array{declared.build(), service(title + " plain")};
-  };
   for (const auto& [path, title] : std::vector<std::pair<std::string, std::string>>{
-           {"/home/u/Library/Services/s.service", "user"},
+           {services + "s.service", "user"},
            {"/OrvexInternal/Library/Services/s.service", "internal"},
            {"/home/u/Library/Services2/s.app", "sibling"},
            {"/Applications/s.app", "application"}}) {
-    const auto declared = dictionary({{"KTBundleIdentifier", title}, {"QVServices", spellChecker(title)}});
-    addBundle(system.files, path, declared);
+    DictionaryBuilder spellChecker(service(title));
+    spellChecker.set("QVSpellChecker", "checker");
+    const Array declared{spellChecker.build(), service(title + " plain")};
+    addBundle(system.files, path, dictionary({{"KTBundleIdentifier", title}, {"QVServices", declared}}));
     if (path.ends_with(".app")) system.registry.registered.push_back({path});
   }
   update(KELStaleEverything);
-  EXPECT_THAT(titles(*store), ElementsAre("application plain", "internal plain", "App", "One", "Two",
-                                          "sibling", "sibling plain", "user", "user plain"));
+  EXPECT_THAT(titles(), ElementsAre("application plain", "internal plain", "App", "One", "Two", "sibling",
+                                    "sibling plain", "user", "user plain"));
 }
 
-TEST_F(DataStoreTest, RestrictionsAreReadAgainOnlyWhenTold) {
+TEST_F(DataStoreTest, RestrictionsAreReadAgainOnlyWhenToldAndKeptWhenTheFileIsGone) {
   addBundle(system.files, one, information("com.orvex.one", "One"));
-  const auto isRestricted = [&] {
-    const Value list = store->currentPublicDictionaries();
-    return list.asArray()->front().asDictionary()->find("QVRestricted") != nullptr;
+  const auto expectRestricted = [&](bool expected, KELStaleCacheFlags flags) {
+    update(flags);
+    const Dictionary first = *store->currentPublicDictionaries().asArray()->front().asDictionary();
+    EXPECT_EQ(first.find("QVRestricted") != nullptr, expected) << flags;
   };
-  update(KELStaleEverything);
-  EXPECT_TRUE(isRestricted());
+  expectRestricted(true, KELStaleEverything);
   const Array row{dictionary({{"QVBundleID", "com.orvex.one"}, {"QVMenuItem", "One"}})};
   system.files.addPropertyList(restrictionsPath, dictionary({{"QVUnrestricted", row}}));
-  update(KELStaleAppRegistryPaths);
-  EXPECT_TRUE(isRestricted());
-  update(KELStaleRestrictionLists);
-  EXPECT_FALSE(isRestricted());
+  expectRestricted(true, KELStaleAppRegistryPaths);
+  expectRestricted(false, KELStaleRestrictionLists);
   system.files.removeTree(restrictionsPath);
-  update(KELStaleRestrictionLists);
-  EXPECT_FALSE(isRestricted()) << "a missing file took the lists away";
+  expectRestricted(false, KELStaleRestrictionLists);
 }
 
 }  // namespace

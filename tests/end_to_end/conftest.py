@@ -33,8 +33,8 @@ def encode(message):
     return plistlib.dumps(message, fmt=plistlib.FMT_BINARY)
 
 
-def frame(payload, kind=REQUEST, tag=7, length=None):
-    return struct.pack(">IIQ", len(payload) if length is None else length, kind, tag) + payload
+def frame(payload, tag=7):
+    return struct.pack(">IIQ", len(payload), REQUEST, tag) + payload
 
 
 class Peer:
@@ -90,9 +90,9 @@ class Home:
         }  # fmt: skip
         self.server = None
 
-    def put_bundle(self, name, title):
-        path = self.home / "Library" / "Services" / name
-        path.mkdir(parents=True)
+    def put_bundle(self, name, title, directory="Library/Services"):
+        path = self.home / directory / name
+        path.mkdir(parents=True, exist_ok=True)
         declared = {"QVMessage": "go", "QVMenuItem": {"default": title}}
         (path / "Info.plist").write_bytes(encode({"KTBundleIdentifier": f"org.example.{name}", "QVServices": [declared]}))
 
@@ -103,9 +103,6 @@ class Home:
     def start(self, **options):
         with open(self.log_path, "ab") as log:
             self.server = self.spawn(stderr=log, **options)
-        self.await_server()
-
-    def await_server(self):
         wait_until(self.connects, "the server")
 
     def connects(self):

@@ -12,8 +12,7 @@ namespace {
 using platform::Bytes;
 
 /// A platform, one bundle and its entry.
-class AppEntryTest : public testing::Test {
- protected:
+struct AppEntryTest : testing::Test {
   AppEntryTest() { addBundle(system.files, path, information); }
 
   std::shared_ptr<KELAppEntry> entryAt(const std::string& bundlePath) {
@@ -68,12 +67,10 @@ TEST_F(AppEntryTest, RefreshReadsTheFourValuesUntilTheyAreWellFormed) {
                                                       {"vers", "1.0"},
                                                       {"service_dicts", *information.find("QVServices")}}));
   EXPECT_EQ(debugLines([&] { entry->refreshCache(); }), "") << "a valid entry is not loaded";
-
   const auto missing = entryAt("/Missing.app");
   EXPECT_EQ(debugLines([&] { missing->refreshCache(); }),
             "Unable to create a bundle for path /Missing.app, skipping it");
-  EXPECT_FALSE(missing->servicesCacheIsValid());
-  EXPECT_FALSE(missing->loadFromBundle(nullptr));
+  EXPECT_FALSE(missing->servicesCacheIsValid() || missing->loadFromBundle(nullptr));
   EXPECT_THAT(system.log.take(), IsEmpty());
 }
 
@@ -130,37 +127,32 @@ TEST_F(AppEntryTest, LocalizationWalkStopsAtTheFirstUsableFileAndRemembersTheMis
   EXPECT_EQ(entry->localizationToMenuStrings(), all);
 }
 
-TEST_F(AppEntryTest, PrecedenceListHoldsEveryDirectoryOnceAtItsFirstPlace) {
+TEST_F(AppEntryTest, DirectoryThenBootVolumeThenPathLengthDecideBetweenCopies) {
   EXPECT_THAT(service_directory_precedence(system.platform),
               ElementsAre("/System/Library/Services/", "/Library/Services/", "/home/u/Library/Services/",
                           "/Applications/", "/OrvexInternal/Library/Services/",
                           "/OrvexInternal/Applications/", "/Network/Library/Services/"));
-}
-
-TEST_F(AppEntryTest, DirectoryThenBootVolumeThenPathLengthDecideBetweenCopies) {
+  const auto wins = [this](const std::string& first, const std::string& second) {
+    return entryAt(first)->shouldTakePriorityOverEntry(*entryAt(second));
+  };
   using Row = std::tuple<std::string, std::string, std::string>;
-  const std::string precedence = "directory precedence", length = "path length";
   for (const auto& [first, second, reason] : {
-           Row{"/System/Library/Services/A long name.service", "/Applications/A.app", precedence},
-           Row{"/Network/Library/Services/A.service", "/x/A.app", precedence},
-           Row{"/Applications/A.app", "/applications/A.app", precedence},
+           Row{"/System/Library/Services/A long name.service", "/Applications/A.app", "directory precedence"},
+           Row{"/Network/Library/Services/A.service", "/x/A.app", "directory precedence"},
+           Row{"/Applications/A.app", "/applications/A.app", "directory precedence"},
            Row{"/home/u/Desktop/Folder/A.app", "/Volumes/D/A.app", "boot volume"},
            Row{"/Volumes.old/A.app", "/Volumes/A.app", "boot volume"},
-           Row{"/Volumes/D/A.app", "/Volumes/D/Old/A.app", length},
-           Row{"/x/\u20ac\u20ac.app", "/x/\U0001F600a.app", length},
+           Row{"/Volumes/D/A.app", "/Volumes/D/Old/A.app", "path length"},
+           Row{"/x/\u20ac\u20ac.app", "/x/\U0001F600a.app", "path length"},
        }) {
-    const auto winner = entryAt(first);
-    const auto loser = entryAt(second);
-    EXPECT_EQ(debugLines([&] { EXPECT_TRUE(winner->shouldTakePriorityOverEntry(*loser)); }),
+    EXPECT_EQ(debugLines([&] { EXPECT_TRUE(wins(first, second)); }),
               "Collision resolution: preferring " + first + " to " + second + " due to " + reason);
-    EXPECT_FALSE(loser->shouldTakePriorityOverEntry(*winner)) << second << " over " << first;
+    EXPECT_FALSE(wins(second, first)) << second << " over " << first;
   }
-  EXPECT_TRUE(entryAt("/x/\U0001F600.app")->shouldTakePriorityOverEntry(*entryAt("/x/ab.app")));
-  EXPECT_TRUE(entryAt("/x/ab.app")->shouldTakePriorityOverEntry(*entryAt("/x/\U0001F600.app")));
+  EXPECT_TRUE(wins("/x/\U0001F600.app", "/x/ab.app") && wins("/x/ab.app", "/x/\U0001F600.app"));
 }
 
-class NormalisationTest : public AppEntryTest {
- protected:
+struct NormalisationTest : AppEntryTest {
   /// The public form without what every service has.
   Dictionary rest(Entries declared, Value tables = Dictionary()) {
     const auto services = publicServices(*cached({{"service_dicts", Array{dictionary(std::move(declared))}},
@@ -260,28 +252,24 @@ TEST_F(NormalisationTest, RestrictedIsReadAsABoolean) {
                   "-1",  Array{}, Dictionary(), Bytes{}, platform::PropertyListDate{}};
   const Array no{false, 0, 0.0, -0.0, "0.5", "000", "NO", "false", "+-1", "+ 1", "", "  "};
   for (const bool expected : {true, false}) {
-    for (const Value& declared : expected ? yes : no) {
+    for (const Value& declared : expected ? yes : no)
       EXPECT_EQ(rest({{"QVRestricted", declared}}), dictionary({{"QVRestricted", expected}}))
           << testing::PrintToString(declared);
-    }
   }
 }
 
 TEST_F(NormalisationTest, ValueThatCannotBeHandledCostsTheRestOfTheEntryOnly) {
   const auto titled = dictionary({{"QVMenuItem", "Open"}});
   const Dictionary::Entry services{"service_dicts", Array{dictionary({}), titled}};
-  const auto tables = dictionary({{"Dutch", true}, {"German", dictionary({})}});
+  const Entries untranslated{services, {"loc_to_menu_strings", dictionary({{"Dutch", true}})}};
+  const Entries large{{"bundle_id", std::string(1 << 20, 'i')}, {"service_dicts", Array(20, titled)}};
   using Row = std::tuple<Entries, std::size_t, std::string>;
   for (const auto& [fields, count, failure] : {
            Row{{{"service_dicts", "x"}}, 0, "the declared services are no array"},
            Row{{{"service_dicts", Array{titled, 7, titled}}}, 1, "service 1 is no dictionary"},
-           Row{{{"bundle_id", std::string(1 << 20, 'i')}, {"service_dicts", Array(20, titled)}},
-               15,
-               "its services are too large"},
+           Row{large, 15, "its services are too large"},
            Row{{services, {"loc_to_menu_strings", 7}}, 1, "the localized menu strings are no dictionary"},
-           Row{{services, {"loc_to_menu_strings", tables}},
-               1,
-               "the menu strings of localization Dutch are neither a table nor false"},
+           Row{untranslated, 1, "the menu strings of localization Dutch are neither a table nor false"},
        }) {
     EXPECT_THAT(publicServices(*cached(fields)), SizeIs(count)) << failure;
     EXPECT_THAT(system.log.take(),
@@ -289,8 +277,7 @@ TEST_F(NormalisationTest, ValueThatCannotBeHandledCostsTheRestOfTheEntryOnly) {
   }
 }
 
-class ValidationTest : public AppEntryTest {
- protected:
+struct ValidationTest : AppEntryTest {
   /// The messages about an entry with these fields, each on a line; the verdict must agree with them, with
   /// and without logging.
   std::string problems(Entries fields) {

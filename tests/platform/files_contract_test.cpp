@@ -14,8 +14,7 @@ namespace {
 
 using namespace std::string_literals;
 using namespace test;
-using testing::Optional;
-using testing::UnorderedElementsAre;
+using namespace testing;
 
 struct InMemoryWorld : InMemoryPlatform {
   void install(const std::string& name, bool withServices) {
@@ -47,9 +46,8 @@ template <class World>
 struct FilesContract : testing::Test {
   enum Way { Atomically, Plainly };
   auto write(const std::string& name, std::string_view text = "", Way way = Atomically) {
-    const Bytes bytes(text.begin(), text.end());
-    return way == Plainly ? files.writePlainly(root + name, bytes)
-                          : files.writeAtomically(root + name, bytes);
+    const auto writing = way == Plainly ? &FileSystem::writePlainly : &FileSystem::writeAtomically;
+    return (files.*writing)(root + name, Bytes(text.begin(), text.end()));
   }
   /// The text of a file, or the reason why there is none.
   std::string read(const std::string& name, std::size_t largest = 9) {

@@ -10,10 +10,8 @@ namespace kel::platform {
 namespace {
 
 using namespace std::string_literals;
-using test::dictionary;
-using test::listOf;
-using testing::HasSubstr;
-using testing::StartsWith;
+using namespace test;
+using namespace testing;
 
 std::string number(std::uint64_t value, std::size_t size) {
   std::string bytes;
@@ -54,28 +52,26 @@ std::string randomText(std::mt19937& random) {
 
 PropertyListValue randomLeaf(std::mt19937& random) {
   const std::uint64_t bits = (static_cast<std::uint64_t>(random()) << 32 | random()) >> random() % 64;
-  const auto kind = random() % 7;
-  if (kind == 0) return random() % 2 == 0;
-  if (kind == 1) return bits;
-  if (kind == 2) return static_cast<std::int64_t>(bits);
-  if (kind == 3) return std::bit_cast<double>(bits);
-  if (kind == 4) return Bytes(random() % (random() % 8 == 0 ? 10000 : 20), static_cast<std::uint8_t>(bits));
-  if (kind == 5) return PropertyListDate{static_cast<double>(random()) * 4.5 - 9e9};
-  return randomText(random);
+  const PropertyListValue leaves[] = {
+      bits % 2 == 0,
+      bits,
+      static_cast<std::int64_t>(bits),
+      std::bit_cast<double>(bits),
+      Bytes(random() % (random() % 8 == 0 ? 10000 : 20), static_cast<std::uint8_t>(bits)),
+      PropertyListDate{static_cast<double>(random()) * 4.5 - 9e9},
+      randomText(random)};
+  return leaves[random() % std::size(leaves)];
 }
 
 /// A value of any kind, containers nesting at most `depth` levels. The same state of `random` gives an equal
 /// value that shares no part with the first. Strings and numbers repeat now and then.
 PropertyListValue randomValue(std::mt19937& random, int depth) {
   if (depth == 0 || random() % 4 == 0) return randomLeaf(random);
-  const auto count = random() % 20;
-  if (random() % 2 == 0) {
-    PropertyListArray array;
-    for (unsigned i = 0; i < count; ++i) array.push_back(randomValue(random, depth - 1));
-    return array;
-  }
+  PropertyListArray array;
+  for (auto count = random() % 20; count > 0; --count) array.push_back(randomValue(random, depth - 1));
+  if (random() % 2 == 0) return array;
   PropertyListDictionaryBuilder builder;
-  for (unsigned i = 0; i < count; ++i) builder.set(randomText(random), randomValue(random, depth - 1));
+  for (const PropertyListValue& value : array) builder.set(randomText(random), value);
   return builder.build();
 }
 

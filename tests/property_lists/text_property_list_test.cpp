@@ -10,13 +10,8 @@ namespace kel::platform {
 namespace {
 
 using namespace std::string_literals;
-using test::Array;
-using test::Dictionary;
-using test::dictionary;
-using test::listOf;
-using test::Value;
-using testing::HasSubstr;
-using testing::StartsWith;
+using namespace test;
+using namespace testing;
 using Reader = PropertyListReading (*)(BytesView bytes, const PropertyListLimits& limits);
 
 constexpr Reader text = readTextPropertyList;

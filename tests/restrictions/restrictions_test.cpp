@@ -20,22 +20,18 @@ Dictionary titled(std::string_view bundleID, std::string_view title) {
   return service(bundleID, dictionary({{"default", title}}));
 }
 
-std::optional<Dictionary> readAndStored(const Dictionary& lists) {
-  return restriction_lists_to_plist(restriction_lists_from_plist(lists).get());
-}
-
 TEST(RestrictionListsTest, StorableFormKeepsOrderAndEmptinessAndLeavesOddRowsOut) {
-  EXPECT_FALSE(restriction_lists_from_plist(std::nullopt));
-  EXPECT_FALSE(restriction_lists_to_plist(nullptr));
-  EXPECT_EQ(readAndStored({}), dictionary({{"QVUnrestricted", Array{}}, {"QVRestricted", Array{}}}));
-  const auto stored = dictionary({{"QVUnrestricted", Array{row("b", "2"), row("a", "1")}},
-                                  {"QVRestricted", Array{row("c", "3"), row("c", "3")}}});
-  EXPECT_EQ(readAndStored(stored), stored);
-  const auto odd = dictionary({{"QVUnrestricted", "no array"},
-                               {"QVRestricted", Array{row("b", "2"), "no row", row(7, "3"), row("c", Array{}),
-                                                      dictionary({{"QVBundleID", "x"}}), row("a", "1")}}});
-  EXPECT_EQ(readAndStored(odd),
-            dictionary({{"QVUnrestricted", Array{}}, {"QVRestricted", Array{row("b", "2"), row("a", "1")}}}));
+  EXPECT_FALSE(restriction_lists_from_plist(std::nullopt) || restriction_lists_to_plist(nullptr));
+  const auto lists = [](Value unrestricted, Value restricted) {
+    return dictionary({{"QVUnrestricted", std::move(unrestricted)}, {"QVRestricted", std::move(restricted)}});
+  };
+  const auto ordered = lists(Array{row("b", "2"), row("a", "1")}, Array{row("c", "3"), row("c", "3")});
+  const auto odd = lists("no array", Array{row("b", "2"), "no row", row(7, "3"), row("c", Array{}),
+                                           dictionary({{"QVBundleID", "x"}}), row("a", "1")});
+  using Row = std::pair<Dictionary, Dictionary>;
+  for (const auto& [read, stored] : {Row{{}, lists(Array{}, Array{})}, Row{ordered, ordered},
+                                     Row{odd, lists(Array{}, Array{row("b", "2"), row("a", "1")})}})
+    EXPECT_EQ(restriction_lists_to_plist(restriction_lists_from_plist(read).get()), stored);
 }
 
 TEST(RestrictionListsTest, MarksWhatTheRulesRestrictAndNothingElse) {
@@ -83,8 +79,7 @@ TEST(RestrictionListsTest, FileIsReadAnewFromTheLastSystemLibraryDirectory) {
   EXPECT_FALSE(load()) << "no library directory";
 }
 
-class WhitelistGeneratorTest : public testing::Test {
- protected:
+struct WhitelistGeneratorTest : testing::Test {
   void publish(Array services) {
     system.publication.publish(dictionary({{"KTVendedServices", std::move(services)}}));
   }
@@ -112,10 +107,9 @@ TEST_F(WhitelistGeneratorTest, ListsVendorServicesInOrderWithoutTheBlacklistedOn
   const Array rows{row("com.orvex.B", "Two"), row("com.orvex.A", "One"), row("com.orvex.B", "Two")};
   EXPECT_EQ(written(), dictionary({{"QVUnrestricted", rows}, {"QVRestricted", Array{}}}));
   Names expected;
-  for (const auto& [bundleID, title] : std::span(default_blacklist).subspan(1, 6)) {
+  for (const auto& [bundleID, title] : std::span(default_blacklist).subspan(1, 6))
     expected.push_back("Blacklisted Service '" + std::string(bundleID) + ":" + std::string(title) +
                        "' not found. Perhaps the blacklist needs to be updated?");
-  }
   EXPECT_EQ(system.log.take(), expected);
 }
 

@@ -24,12 +24,10 @@ class InMemoryFileSystem : public platform::FileSystem {
       const Node* node = state.use(directory);
       if (state.failsFor(directory)) return {std::nullopt, directory + ": Input/output error", true};
       if (!node || *node) return {std::nullopt, directory + ": no directory", false};
-      const std::string prefix = normalised(directory) + "/";
       std::vector<std::string> names;
-      for (auto at = state.nodes.upper_bound(prefix); at != state.nodes.end(); ++at) {
-        if (!at->first.starts_with(prefix)) break;
-        std::string name = at->first.substr(prefix.size());
-        if (name.find('/') == std::string::npos) names.push_back(std::move(name));
+      for (const auto& [path, child] : state.nodes) {
+        const std::size_t slash = path.rfind('/');
+        if (path.substr(0, slash) == normalised(directory)) names.push_back(path.substr(slash + 1));
       }
       return {std::move(names), {}, false};
     });

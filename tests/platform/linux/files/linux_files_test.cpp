@@ -14,10 +14,7 @@ namespace {
 
 using namespace std::string_literals;
 using namespace std::chrono_literals;
-using testing::ElementsAre;
-using testing::EndsWith;
-using testing::IsEmpty;
-using testing::StartsWith;
+using namespace testing;
 
 TEST_F(ScratchTest, FileThatStatesNoSizeIsReadInOnePieceWhenItIsSmallAndANULDoesNotCutThePath) {
   EXPECT_THAT(readSmallFile(AT_FDCWD, "/proc/sys/kernel/pid_max"), testing::Optional(EndsWith("\n")));
@@ -58,9 +55,8 @@ TEST_F(ScratchTest, APrivateDirectoryIsOneThatNobodyElseCanWriteTo) {
   umask(before);
   EXPECT_EQ(scratch.mode("kel"), 0700U);
   ASSERT_EQ(symlink(path.c_str(), (scratch / "link").c_str()), 0);
-  for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"}) {
+  for (const std::string& wrong : {scratch / "link", scratch.write("file"), scratch / "missing/kel"})
     EXPECT_EQ(makePrivateDirectory(wrong).path, std::nullopt) << wrong;
-  }
   chmod(path.c_str(), 0720);
   EXPECT_THAT(makePrivateDirectory(path).error, EndsWith("kel: others may write to it"));
   if (geteuid() == 0 && chown(path.c_str(), 12345, 12345) == 0) {
@@ -68,32 +64,27 @@ TEST_F(ScratchTest, APrivateDirectoryIsOneThatNobodyElseCanWriteTo) {
   }
 }
 
-class LinuxApplicationsTest : public ScratchTest {
- protected:
-  LinuxApplicationsTest() {
-    for (const char* name : {"a/fifo.app", "a/device.app", "a/missing.app"}) scratch.makeDirectory(name);
-    mkfifo((scratch / "a/fifo.app/Info.plist").c_str(), 0600);
-    symlink("/dev/zero", (scratch / "a/device.app/Info.plist").c_str());
-    scratch.write("a/malformed.app/Info.plist", "{ QVServices = (");
-    truncate(scratch.write("a/huge.app/Info.plist").c_str(), largestForeignFile + 1);
-  }
-
+struct LinuxApplicationsTest : ScratchTest {
   /// The paths of the applications found, below the scratch directory.
   std::vector<std::string> found(std::uint32_t flags) {
     LinuxApplicationRegistry registry(files, log, queue, {scratch / "b/", scratch / "a/", scratch / "none/"},
                                       std::nullopt, nullptr);
     std::vector<std::string> result;
-    for (const RegisteredApplication& application : registry.applications(flags, flags).applications) {
+    for (const RegisteredApplication& application : registry.applications(flags, flags).applications)
       result.push_back(application.path.value().substr(scratch.path().size() + 1));
-    }
     return result;
   }
 
-  LinuxBundles bundles{files, log};
   ConcurrentQueue queue;
 };
 
 TEST_F(LinuxApplicationsTest, UnusableInformationCountsAsEmptyAndIsLoggedOnceUnlessItIsMissing) {
+  for (const char* name : {"a/fifo.app", "a/device.app", "a/missing.app"}) scratch.makeDirectory(name);
+  mkfifo((scratch / "a/fifo.app/Info.plist").c_str(), 0600);
+  symlink("/dev/zero", (scratch / "a/device.app/Info.plist").c_str());
+  scratch.write("a/malformed.app/Info.plist", "{ QVServices = (");
+  truncate(scratch.write("a/huge.app/Info.plist").c_str(), largestForeignFile + 1);
+  LinuxBundles bundles(files, log);
   for (const std::string name : {"missing", "fifo", "device", "malformed", "huge"}) {
     const auto bundle = bundles.open(scratch / "a/" + name + ".app");
     EXPECT_TRUE(bundle->information().dictionary.empty() && !bundle->identifier()) << name;
@@ -106,18 +97,14 @@ TEST_F(LinuxApplicationsTest, UnusableInformationCountsAsEmptyAndIsLoggedOnceUnl
 }
 
 TEST_F(LinuxApplicationsTest, RegistryHoldsTheApplicationsInPlainFoldersByRootAndPath) {
-  std::filesystem::remove_all(scratch / "a");
   std::string deep = "b";
   for (int level = 0; level < 40; ++level) deep += "/f";
-  for (const std::string& name : {"a/A.app/Contents/Inner.app"s, "a/.hidden/H.app"s, deep + "/Deep.app"}) {
+  for (const std::string& name :
+       {"a/A.app/Contents/Inner.app"s, "a/.hidden/H.app"s, "a/Plug.bundle/Inner.app"s, deep + "/Deep.app"})
     scratch.makeDirectory(name);
-  }
-  for (const char* bundle :
-       {"a/Z.app", "a/Tools/More/T.app", "a/Plug.bundle", "b/Later.app", "x/Linked.app"}) {
+  for (const char* bundle : {"a/Z.app", "a/Tools/More/T.app", "a/Plug.bundle", "b/Later.app", "x/Linked.app"})
     scratch.write(std::string(bundle) + "/Info.plist", "{ QVServices = ({}); }");
-  }
   scratch.write("a/A.app/Info.plist", "{ QVServices = (); }");
-  scratch.makeDirectory("a/Plug.bundle/Inner.app");
   scratch.write("a/File.app");
   symlink("../x/Linked.app", (scratch / "a/Link.app").c_str());
   symlink("../x", (scratch / "a/folder").c_str());
@@ -128,26 +115,24 @@ TEST_F(LinuxApplicationsTest, RegistryHoldsTheApplicationsInPlainFoldersByRootAn
   EXPECT_THAT(log.take(), testing::Each(StartsWith("Too many or too deep folders in ")));
 }
 
-class LinuxNotificationSeedsTest : public ScratchTest {
- protected:
-  SerialQueue queue{"observer"};
+struct LinuxNotificationSeedsTest : ScratchTest {
   LinuxNotificationSeeds seeds{scratch / "beacond", log};
   LinuxNotificationSeeds other{scratch / "beacond", log};  // stands for another process
-  Semaphore called;
 };
 
 TEST_F(LinuxNotificationSeedsTest, PostsOfManyThreadsAndInstancesAreAllCounted) {
-  const NotificationStore store{scratch / "beacond"};
   seeds.post("name");
-  const auto start = store.read("name")->posts;
-  std::vector<std::thread> threads;
-  for (LinuxNotificationSeeds* instance : {&seeds, &other, &seeds, &other}) {
-    threads.emplace_back([instance] {
-      for (int i = 0; i < 250; ++i) instance->post("name");
-    });
+  const auto posts = [this] { return NotificationStore{scratch / "beacond"}.read("name")->posts; };
+  const auto start = posts();
+  {
+    std::vector<std::jthread> threads;
+    for (LinuxNotificationSeeds* instance : {&seeds, &other, &seeds, &other}) {
+      threads.emplace_back([instance] {
+        for (int i = 0; i < 250; ++i) instance->post("name");
+      });
+    }
   }
-  for (std::thread& thread : threads) thread.join();
-  EXPECT_EQ(store.read("name")->posts, start + 1000);
+  EXPECT_EQ(posts(), start + 1000);
   EXPECT_THAT(scratch.names("beacond"), ElementsAre(".lock", "name"));
 }
 
@@ -171,7 +156,9 @@ TEST_F(LinuxNotificationSeedsTest, RecordThatIsCutOrChangedAnywhereCountsAsNever
 }
 
 TEST_F(LinuxNotificationSeedsTest, PostsAreSeenAlsoAfterDamageAndLoss) {
-  auto observation = seeds.observe("name", queue, [this] { called.signal(); });
+  SerialQueue queue("observer");
+  Semaphore called;
+  auto observation = seeds.observe("name", queue, [&] { called.signal(); });
   scratch.write("beacond/name", "damaged");
   other.post("name");
   EXPECT_TRUE(called.wait(20s));

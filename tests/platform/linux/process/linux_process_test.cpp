@@ -14,10 +14,7 @@
 namespace kel::platform {
 namespace {
 
-using testing::ElementsAre;
-using testing::EndsWith;
-using testing::MatchesRegex;
-using testing::StartsWith;
+using namespace testing;
 
 TEST(LinuxProcess, MayHaveEveryDescriptorItIsEntitledTo) {
   rlimit limit{};
@@ -37,10 +34,9 @@ TEST(ProcessConfinement, ScopesOfSandboxedRuntimesAndConfiningLabelsAreToldAndDo
   EXPECT_FALSE(namesSandboxScope("0::/app.slice/app-flatpak-org.example.App.scope-1/snap.editor\n"));
   EXPECT_TRUE(isConfiningLabel("snap.editor.editor (enforce)", "unconfined"));
   EXPECT_TRUE(isConfiningLabel("system_u:system_r:container_t:s0:c1,c2", ""));
-  EXPECT_FALSE(isConfiningLabel("container (enforce)", "container (enforce)"));
-  for (const char* label : {"", "browser (unconfined)", "unconfined_u:unconfined_r:unconfined_t:s0"}) {
-    EXPECT_FALSE(isConfiningLabel(label, "server (enforce)")) << label;
-  }
+  for (const char* label :
+       {"", "browser (unconfined)", "unconfined_u:unconfined_r:unconfined_t:s0", "container (enforce)"})
+    EXPECT_FALSE(isConfiningLabel(label, "container (enforce)")) << label;
 }
 
 using LinuxSystemFactsTest = ScratchTest;
@@ -83,12 +79,10 @@ TEST_F(LinuxSystemFactsTest, NumbersAreReadWholeOrNotAtAll) {
 }
 
 TEST(OptionParser, BadOptionsAreReportedOnTheErrorStream) {
-  const std::pair<std::string, std::string> rows[] = {
-      {"-f", "unrecognized option '-f'"},
-      {"-dum", "option '-dum' is ambiguous; possibilities: '-dump' '-dump_cache'"},
-      {"-flush=now", "option '-flush' doesn't allow an argument"},
-  };
-  for (const auto& [argument, message] : rows) {
+  for (const auto& [argument, message] : std::vector<std::pair<std::string, std::string>>{
+           {"-f", "unrecognized option '-f'"},
+           {"-dum", "option '-dum' is ambiguous; possibilities: '-dump' '-dump_cache'"},
+           {"-flush=now", "option '-flush' doesn't allow an argument"}}) {
     testing::internal::CaptureStderr();
     OptionParser parser({"kel", "en", argument}, {{"dump", 2}, {"dump_cache", 3}, {"flush", 5}});
     EXPECT_EQ(parser.next().outcome, ParsedOption::Outcome::Bad);
@@ -107,14 +101,12 @@ OwnedDescriptor daemonAt(const std::string& name) {
 std::vector<std::string> received(const OwnedDescriptor& daemon) {
   std::vector<std::string> messages;
   char buffer[65536];
-  for (ssize_t length = 0; (length = recv(daemon.get(), buffer, sizeof buffer, MSG_DONTWAIT)) >= 0;) {
+  for (ssize_t length = 0; (length = recv(daemon.get(), buffer, sizeof buffer, MSG_DONTWAIT)) >= 0;)
     messages.emplace_back(buffer, static_cast<std::size_t>(length));
-  }
   return messages;
 }
 
-class LinuxSystemLogTest : public testing::Test {
- protected:
+struct LinuxSystemLogTest : testing::Test {
   Scratch scratch;
   OwnedDescriptor daemon = daemonAt(scratch / "log");
   LinuxSystemLog log{scratch / "log"};
@@ -143,13 +135,12 @@ TEST_F(LinuxSystemLogTest, MessagesThatTheDaemonDoesNotTakeAreCountedAndToldLate
 }
 
 TEST(EscapedForLog, ControlCharactersAndIllFormedBytesBecomeOctalAndOverlongTextIsCut) {
-  const std::pair<std::string, std::string> rows[] = {
-      {std::string("a\nb\0del\x7f", 8), "a#012b#000del#177"},
-      {"caf\xc3\xa9 \xef\xbf\xbd", "caf\xc3\xa9 \xef\xbf\xbd"},
-      {"c1\xc2\x9b bad\xff\xc3", "c1#302#233 bad#377#303"},
-      {std::string(3900, 'a'), std::string(3900, 'a')},
-  };
-  for (const auto& [text, escaped] : rows) EXPECT_EQ(escapedForLog(text), escaped);
+  for (const auto& [text, escaped] : std::vector<std::pair<std::string, std::string>>{
+           {std::string("a\nb\0del\x7f", 8), "a#012b#000del#177"},
+           {"caf\xc3\xa9 \xef\xbf\xbd", "caf\xc3\xa9 \xef\xbf\xbd"},
+           {"c1\xc2\x9b bad\xff\xc3", "c1#302#233 bad#377#303"},
+           {std::string(3900, 'a'), std::string(3900, 'a')}})
+    EXPECT_EQ(escapedForLog(text), escaped);
   for (std::size_t shift = 0; shift < 4; ++shift) {
     std::string text(shift, 'a');
     for (int i = 0; i < 100'000; ++i) text += "\xf0\x9f\x98\x80";
