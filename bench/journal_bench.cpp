@@ -103,10 +103,10 @@ class Journal {
   Journal(const std::string& corpus, bool live)
       : corpus_(corpus), state_(corpus + (live ? ".live-journal" : ".journal")) {
     options_.directory = state_;
-    options_.limits.live = live;
+    options_.limits.mayWatch = [live] { return live; };
+    options_.betweenSavings = std::chrono::milliseconds(0);
     fs::remove_all(state_);
     start();
-    journal_->currentEventID();
     stop();
   }
   ~Journal() { fs::remove_all(state_); }
@@ -115,7 +115,7 @@ class Journal {
   void start() {
     journal_ = std::make_unique<LinuxEventJournal>(options_, files_, log_, pool_);
     journal_->setRoots({{corpus_ + "/Library/Services/", false}, {corpus_ + "/Applications/", true}});
-    journal_->currentEventID();
+    journal_->service()->save();
   }
   void stop() { journal_.reset(); }
 

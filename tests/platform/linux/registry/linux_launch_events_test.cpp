@@ -36,7 +36,7 @@ TEST_F(ScratchTest, EveryLaunchEventStreamFiresAtTheStartAndForItsOwnChanges) {
   EXPECT_TRUE(beacond.hasFired() && broadcastd.hasFired() && vigil.hasFired()) << "at the start";
   EXPECT_TRUE(broadcastd.fires()) << "at the end of the first scan";
 
-  journal.currentEventID();  // everything is watched by now
+  journal.service()->save();  // everything is watched by now
   scratch.write("Services/a.service/Info.plist");
   EXPECT_TRUE(vigil.fires());
   EXPECT_FALSE(beacond.hasFired());
