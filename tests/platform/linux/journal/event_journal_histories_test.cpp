@@ -3,6 +3,7 @@
 #include <map>
 #include <random>
 #include <sched.h>
+#include <sstream>
 #include <stdio.h>
 #include <sys/mman.h>
 #include <sys/mount.h>
@@ -44,7 +45,7 @@ class Disk {
   }
   ~Disk() {
     close(kept_);
-    for (const std::string& mounted : mounted_) umount2(mounted.c_str(), MNT_DETACH);
+    unmountAll();
   }
 
   /// Every bundle with what a loader would find in it, links followed.
@@ -244,16 +245,26 @@ class Disk {
     const std::string over = below(2) ? anyFile() : anyBundle();
     const std::string under = outside_ + "spare" + std::to_string(below(4));
     const bool isFile = over.ends_with(".plist");
-    if (!mounts_ || mounted_.size() > 4 || !fs::exists(over) || fs::is_directory(over) == isFile) return;
+    if (!mounts_ || !fs::exists(over) || fs::is_directory(over) == isFile) return;
     const std::string from = isFile ? under + "/Info.plist" : under;
-    if (mount(from.c_str(), over.c_str(), nullptr, MS_BIND, nullptr) == 0) mounted_.push_back(over);
+    touchAll();
+    mount(from.c_str(), over.c_str(), nullptr, MS_BIND, nullptr);
     overwrite(over), overwrite(from), touchAll();
   }
-  void unbind() {
-    if (mounted_.empty()) return;
-    touchAll();
-    umount2(mounted_.back().c_str(), MNT_DETACH);
-    mounted_.pop_back();
+  void unbind() { touchAll(), unmountAll(), touchAll(); }
+
+  /// By the kernel's table: what is mounted on moves with the directories above it.
+  void unmountAll() {
+    std::vector<std::string> points;
+    std::ifstream table("/proc/self/mountinfo");
+    for (std::string line; std::getline(table, line);) {
+      std::istringstream fields(line);
+      std::string field, point;
+      for (int count = 0; count < 4; ++count) fields >> field;
+      fields >> point;
+      if (point.starts_with(fs::path(home_).parent_path().string() + "/")) points.push_back(point);
+    }
+    while (!points.empty()) umount2(points.back().c_str(), MNT_DETACH), points.pop_back();
   }
 
   static void waitForAnotherTick() {
@@ -266,7 +277,6 @@ class Disk {
   std::mt19937 random_;
   const bool mounts_;
   int kept_ = -1;
-  std::vector<std::string> mounted_;
 };
 
 /// Writes without waiting for the disk, or not at all.

@@ -37,6 +37,9 @@ TEST_F(ScratchTest, EveryLaunchEventStreamFiresAtTheStartAndForItsOwnChanges) {
   EXPECT_TRUE(broadcastd.fires()) << "at the end of the first scan";
 
   journal.service()->save();  // everything is watched by now
+  EXPECT_TRUE(vigil.fires() && beacond.fires()) << "for what was never looked at before";
+  while (vigil.hasFired()) {
+  }
   scratch.write("Services/a.service/Info.plist");
   EXPECT_TRUE(vigil.fires());
   EXPECT_FALSE(beacond.hasFired());
