@@ -24,7 +24,7 @@ bool KELPathChangeObservationRequest::runWithPaths(const std::vector<std::string
   eventStream_ =
       journal_.createStream(std::move(callback), paths, streamID, std::chrono::nanoseconds::zero(), flags);
   if (!eventStream_) return false;
-  if (!queue_) queue_.emplace("kel VigilStream");
+  queue_ = &journal_.streamQueue();
   eventStream_->setQueue(*queue_);
   if (!eventStream_->start()) {
     eventStream_->invalidate();

@@ -1,7 +1,6 @@
 #pragma once
 
 #include <memory>
-#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -43,7 +42,7 @@ class KELPathChangeObservationRequest : public std::enable_shared_from_this<KELP
 
   platform::EventJournal& journal_;
   std::unique_ptr<platform::JournalStream> eventStream_;
-  std::optional<platform::SerialQueue> queue_;  // made with the stream: a journal may have none to give
+  platform::SerialQueue* queue_ = nullptr;  // the journal's; null before the stream is made
   platform::Semaphore waiter_;
 
   // Written on queue_ until the semaphore is signalled, read by the waiting thread afterwards.

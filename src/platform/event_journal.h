@@ -44,8 +44,8 @@ class JournalStream {
   /// The queue that events arrive on; before `start`. It outlives the stream.
   virtual void setQueue(SerialQueue& queue) = 0;
 
-  /// Delivers the events since the stream's position, then one flagged history done, then live ones. False
-  /// when it cannot.
+  /// Delivers the events since the stream's position, then one flagged history done, and no more. False when
+  /// it cannot.
   virtual bool start() = 0;
 
   /// On the stream's queue: no further events are gathered.
@@ -68,6 +68,10 @@ class EventJournal {
                                                       const std::vector<std::string>& paths, EventID since,
                                                       std::chrono::nanoseconds latency,
                                                       std::uint32_t flags) = 0;
+
+  /// A queue for the events of streams, for whoever has none: it is there from the start, so that a question
+  /// needs no thread of its own. Only when a stream could be made.
+  virtual SerialQueue& streamQueue() = 0;
 };
 
 }  // namespace kel::platform

@@ -155,6 +155,8 @@ class InMemoryJournal : public platform::EventJournal {
     return std::make_unique<Stream>(*this, std::move(callback), std::move(batch));
   }
 
+  platform::SerialQueue& streamQueue() override { return streamQueue_; }
+
   /// Records an event at the next position.
   void record(const std::string& path, std::uint32_t flags = 0) {
     events_.push_back({path, flags, ++newest_});
@@ -203,6 +205,7 @@ class InMemoryJournal : public platform::EventJournal {
 
   platform::EventID newest_ = 1000;
   std::vector<platform::JournalEvent> events_;
+  platform::SerialQueue streamQueue_{"kel VigilStream"};
 };
 
 /// A process whose main loop runs a test's work and then returns.

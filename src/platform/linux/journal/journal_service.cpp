@@ -39,6 +39,7 @@ JournalService::JournalService(std::vector<WatchedRoot> roots, const JournalOpti
       forest_(
           std::move(roots), options.limits, [this] { return positions_.next(); }, log, pool),
       mounts_(openFile(AT_FDCWD, "/proc/self/mountinfo", O_RDONLY)),
+      streamQueue_("kel VigilStream"),
       queue_("kel Journal") {
   queue_.async([this] {
     queue_.assertCurrent();

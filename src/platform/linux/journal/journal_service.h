@@ -58,6 +58,9 @@ class JournalService {
   void eventsSince(EventID since, std::vector<std::string> paths, bool watchesRoot,
                    std::function<void(std::vector<JournalEvent>)> answer);
 
+  /// Where streams may have their events delivered.
+  SerialQueue& streamQueue() { return streamQueue_; }
+
   /// Looks at everything, and waits until what is known is on the disk: for measurements and tests. False
   /// when it could not be written.
   bool save();
@@ -108,6 +111,7 @@ class JournalService {
   bool failureReported_ KEL_ON(queue_) = false;
   std::chrono::steady_clock::time_point lastSaving_ KEL_ON(queue_);
 
+  SerialQueue streamQueue_;
   Group writing_;
   SerialQueue queue_;  // the last, so that it ends before what its tasks touch
 };

@@ -108,6 +108,8 @@ std::unique_ptr<JournalStream> LinuxEventJournal::createStream(JournalCallback c
                                   (flags & stream_flags::watchRoot) != 0);
 }
 
+SerialQueue& LinuxEventJournal::streamQueue() { return service_->streamQueue(); }
+
 bool LinuxEventJournal::changedSince(const std::vector<std::string>& paths, EventID since) {
   JournalService* const running = service();
   return !running || !running->eventsSince(since, paths, true).empty();

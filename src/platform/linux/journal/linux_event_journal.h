@@ -47,6 +47,8 @@ class LinuxEventJournal final : public EventJournal, public ChangeLog {
                                               EventID since, std::chrono::nanoseconds latency,
                                               std::uint32_t flags) override;
 
+  SerialQueue& streamQueue() override;
+
   bool changedSince(const std::vector<std::string>& paths, EventID since) override;
 
   /// Null when there is no thread for it.
