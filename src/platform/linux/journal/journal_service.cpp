@@ -37,7 +37,12 @@ JournalService::JournalService(std::vector<WatchedRoot> roots, const JournalOpti
       indexPath_(inDirectory(options.directory, "journal")),
       positions_(files, log, inDirectory(options.directory, "journal-position")),
       forest_(
-          std::move(roots), options.limits, [this] { return positions_.next(); }, log, pool),
+          std::move(roots), options.limits,
+          [this] {
+            queue_.assertCurrent();
+            return positions_.next();
+          },
+          log, pool),
       mounts_(openFile(AT_FDCWD, "/proc/self/mountinfo", O_RDONLY)),
       streamQueue_("kel VigilStream"),
       queue_("kel Journal") {
@@ -111,7 +116,7 @@ std::vector<JournalEvent> JournalService::answer(EventID since, const std::vecto
   }
   lookForQuestion();
   // Without its index no position is trusted either.
-  if (!positions_.tell(forest_.latestEvent())) files_.remove(indexPath_);
+  if (!positions_.tell(forest_.latestEvent())) files_.remove(indexPath_), savedID_ = 0;
   finishRound();
   std::vector<JournalEvent> events;
   for (const std::string& path : paths) {
@@ -141,7 +146,7 @@ void JournalService::open() {
       doubtMounts();
     });
   }
-  after(options_.beforeFirstLook, &JournalService::lookInBackground);
+  scheduleLook(options_.beforeFirstLook);
 }
 
 /// An instance that was not to be had is tried for again, now and then.
@@ -165,9 +170,17 @@ void JournalService::lookForQuestion() {
   hasLooked_ = hasLooked_ || !forest_.hasDoubts();
 }
 
+/// Instead of what was scheduled before.
+void JournalService::scheduleLook(std::chrono::nanoseconds delay) {
+  queue_.after(delay, [this, number = ++lookNumber_] {
+    queue_.assertCurrent();
+    if (number == lookNumber_ && !isLooking_) lookInBackground();
+  });
+}
+
 void JournalService::lookInBackground() {
+  isLooking_ = true;
   isLookingSoon_ = false;
-  if (std::exchange(isLooking_, true)) return;
   noteMounts();
   openEvents();
   forest_.doubtUncovered();
@@ -182,7 +195,8 @@ void JournalService::lookFurther() {
   } else {
     isLooking_ = false;
     hasLooked_ = true;
-    after(options_.betweenLooks, &JournalService::lookInBackground);
+    isLookingSoon_ = false;
+    scheduleLook(options_.betweenLooks);
   }
   finishRound();
 }
@@ -205,7 +219,7 @@ void JournalService::noteMounts() {
 
 void JournalService::doubtMounts() {
   forest_.doubtEverything();
-  if (!std::exchange(isLookingSoon_, true)) after(afterMount, &JournalService::lookInBackground);
+  if (!std::exchange(isLookingSoon_, true)) scheduleLook(afterMount);
 }
 
 /// After whatever may have found something.

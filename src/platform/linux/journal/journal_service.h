@@ -74,6 +74,7 @@ class JournalService {
   void open() KEL_RUNS_ON(queue_);
   void openEvents() KEL_RUNS_ON(queue_);
   void lookForQuestion() KEL_RUNS_ON(queue_);
+  void scheduleLook(std::chrono::nanoseconds delay) KEL_RUNS_ON(queue_);
   void lookInBackground() KEL_RUNS_ON(queue_);
   void lookFurther() KEL_RUNS_ON(queue_);
   void readEvents() KEL_RUNS_ON(queue_);
@@ -101,6 +102,7 @@ class JournalService {
   bool hasLooked_ KEL_ON(queue_) = false;
   bool isLooking_ KEL_ON(queue_) = false;  // a look in the background is under way
   bool isLookingSoon_ KEL_ON(queue_) = false;
+  std::uint64_t lookNumber_ KEL_ON(queue_) = 0;
   bool isClosing_ KEL_ON(queue_) = false;
   EventID lastGiven_ KEL_ON(queue_) = 0;
   EventID savedEvent_ KEL_ON(queue_) = 0;  // the newest event that the index on the disk holds

@@ -279,6 +279,18 @@ TEST_P(LiveEventJournalTest, WhoOnlyWaitsIsToldOfWhatEventsDoNotTell) {
   EXPECT_THAT(replay(there), ElementsAre("a.service/Info.plist"));
 }
 
+TEST_P(LiveEventJournalTest, ADictionaryBehindALinkToALargeDirectoryIsToldAtOnce) {
+  changed = [this](JournalForest::Hints) { news.signal(); };
+  options.betweenLooks = std::chrono::hours(1);
+  for (int index = 0; index < 2000; ++index) scratch.write("elsewhere/" + std::to_string(index));
+  scratch.write("elsewhere/Info.plist", "declared");
+  fs::create_directory_symlink(scratch / "elsewhere", root + "linked.service");
+  position();
+  forgetNews();
+  scratch.write("elsewhere/Info.plist", "DECLARED");
+  EXPECT_TRUE(isTold());
+}
+
 TEST_P(LiveEventJournalTest, WhatDecidesNothingWakesNobody) {
   changed = [this](JournalForest::Hints) { news.signal(); };
   options.limits.home = scratch / "home";
