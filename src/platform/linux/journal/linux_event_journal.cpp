@@ -12,14 +12,16 @@ namespace {
 
 /// One reader of the journal. Its callback runs on its own queue, and never after `close`.
 struct Reader {
+  explicit Reader(JournalCallback toCall) : callback(std::move(toCall)) {}
+
   const JournalCallback callback;
   Guarded<SerialQueue*> queue;  // null when it is closed, or has not been opened
 
   static void deliver(const std::shared_ptr<Reader>& reader, std::vector<JournalEvent> events) {
     // Handed over while the reader cannot be closed: its queue is still there.
-    reader->queue.with([&](SerialQueue* queue) {
-      if (!queue) return;
-      queue->async([reader, events = std::move(events)] {
+    reader->queue.with([&](SerialQueue* open) {
+      if (!open) return;
+      open->async([reader, events = std::move(events)] {
         if (reader->queue.copy()) reader->callback(events);
       });
     });
