@@ -47,10 +47,7 @@ bool JournalForest::openEvents() {
                "Cannot watch directories now, changes are found by looking: " + errorText(errno));
     return false;
   }
-  for (const auto& tree : trees_) {
-    tree->approachChanged = true;
-    doubtBelow(tree->root());
-  }
+  doubtEverything();
   return true;
 }
 

@@ -77,7 +77,7 @@ class JournalForest {
   /// Doubts what no event tells of: what is uncovered, and where the roots' paths lead.
   void doubtUncovered();
 
-  /// After a mount everything may be another, and so may the numbers of the file systems.
+  /// Everything may be another, and so may the numbers of the file systems.
   void doubtEverything();
 
   enum class LookMode {

@@ -71,9 +71,8 @@ void JournalForest::noteName(JournalNode& folder, std::string_view name, bool is
 
 void JournalForest::noteOverflow(EventID id) {
   reportOnce(overflowReported_, "Changes came faster than they could be told: looking at everything again");
+  doubtEverything();
   for (const auto& tree : trees_) {
-    tree->approachChanged = true;
-    doubtBelow(tree->root());
     hint(*tree);
     // A look may have recorded what the lost events were to tell.
     if (tree->horizon != JournalTree::noHorizon) tree->horizon = id;
