@@ -10,6 +10,7 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <functional>
+#include <malloc.h>
 #include <mutex>
 #include <string>
 #include <sys/inotify.h>
@@ -104,10 +105,15 @@ class Journal {
       : corpus_(corpus), state_(corpus + (live ? ".live-journal" : ".journal")) {
     options_.directory = state_;
     options_.applicationDirectories = {corpus_ + "/Applications/"};
-    options_.limits.live = live;
+    options_.limits.mayWatch = [live] { return live; };
+    options_.betweenSavings = std::chrono::milliseconds(0);
     fs::remove_all(state_);
+    const std::size_t before = mallinfo2().uordblks;
+    const auto begin = std::chrono::steady_clock::now();
     start();
-    journal_->currentEventID();
+    firstLook = std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+    heap = mallinfo2().uordblks - before;
+    size = journal_->service()->size();
     stop();
   }
   ~Journal() { fs::remove_all(state_); }
@@ -116,9 +122,13 @@ class Journal {
   void start() {
     journal_ = std::make_unique<LinuxEventJournal>(options_, files_, log_, pool_);
     journal_->watch({corpus_ + "/Library/Services/"});
-    journal_->currentEventID();
+    journal_->service()->save();
   }
   void stop() { journal_.reset(); }
+
+  double firstLook = 0;  ///< in seconds, until it is on the disk
+  std::size_t heap = 0;  ///< bytes of memory after it
+  JournalForest::Size size;
 
  private:
   const std::string corpus_;
@@ -151,6 +161,10 @@ void compare(benchmark::State& state, bool live, const std::function<double(cons
   }
   state.counters["bare_ms"] = benchmark::Counter(bareTime * 1000, benchmark::Counter::kAvgIterations);
   state.counters["ratio"] = journalTime / bareTime;
+  state.counters["first_ms"] = journal.firstLook * 1000;
+  state.counters["records"] = static_cast<double>(journal.size.records);
+  state.counters["watches"] = static_cast<double>(journal.size.watches);
+  state.counters["heap_MB"] = static_cast<double>(journal.heap) / 1e6;
 }
 
 /// A restart without changes: reading the index and comparing the disk with it.

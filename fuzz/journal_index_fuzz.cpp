@@ -8,9 +8,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     if (!index) return std::nullopt;
     Bytes written = encodeIndex(index->lastID, index->trees);
     for (const auto& tree : index->trees) {
-      if (!tree->root().directory || tree->root().isGone) std::abort();
+      if (tree->root().state != RecordState::Doubted || tree->root().role != RecordRole::Folder) std::abort();
       tree->clear(tree->root());
-      if (tree->nodeCount != 0 || tree->vanishedCount != 0) std::abort();
+      if (tree->nodeCount != 0 || tree->goneCount != 0 || tree->doubtedCount != 1) std::abort();
     }
     return written;
   };

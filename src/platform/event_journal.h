@@ -44,8 +44,8 @@ class JournalStream {
   /// The queue that events arrive on; before `start`. It outlives the stream.
   virtual void setQueue(SerialQueue& queue) = 0;
 
-  /// Delivers the events since the stream's position, then one flagged history done, then live ones. False
-  /// when it cannot.
+  /// Delivers the events since the stream's position, then one flagged history done, and no more. False when
+  /// it cannot.
   virtual bool start() = 0;
 
   /// On the stream's queue: no further events are gathered.

@@ -136,18 +136,5 @@ TEST_F(PathChangesObserverTest, AReplayThatTakesTooLongSaysNothingAboutItsPaths)
   EXPECT_EQ(observe({"/A/x"}), "") << "the paths count as observed";
 }
 
-TEST_F(PathChangesObserverTest, BatchesAfterTheHistoryAreIgnoredAndSignalNothing) {
-  journal.record("/A/x");
-  const auto request = KELPathChangeObservationRequest::init(journal);
-  ASSERT_TRUE(request->runWithPaths({"/A/"}, 1000));
-  ASSERT_TRUE(request->waiter().wait(std::chrono::seconds(60)));
-  journal.record("/A/late");
-  journal.record("/A/z", mustScan);
-  request->stop();
-  EXPECT_THAT(request->changedSubpaths(), ElementsAre("/A/x"));
-  EXPECT_FALSE(request->mustDoFullScan());
-  EXPECT_FALSE(request->waiter().wait(std::chrono::nanoseconds(0)));
-}
-
 }  // namespace
 }  // namespace kel

@@ -18,7 +18,11 @@ struct InMemoryStreams {
 };
 
 struct LinuxStreams {
-  LinuxStreams() { journal.watch({services}); }
+  LinuxStreams() {
+    journal.watch({services});
+    journal.changedSince({services, applications},
+                         journal.currentEventID());  // what a first look finds is news
+  }
   ~LinuxStreams() {
     EXPECT_THAT(log.take(), testing::ElementsAre(std::string("There is no launch-event stream ") + unknown));
   }
@@ -37,7 +41,7 @@ struct LinuxStreams {
   LinuxFileSystem files{log};
   ConcurrentQueue pool;
   LinuxNotificationSeeds seeds{scratch / "run", log};
-  LinuxEventJournal journal{{{applications}, {}, {}}, files, log, pool};
+  LinuxEventJournal journal{{{applications}, scratch / "state", {}}, files, log, pool};
   LinuxApplicationRegistry registry{files, log, pool, {applications}, scratch / "state", &journal};
   LinuxLaunchEvents launchEvents{seeds, log, journal, registry};
 };

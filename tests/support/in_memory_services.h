@@ -176,10 +176,9 @@ class InMemoryJournal : public platform::EventJournal {
     return std::make_unique<Stream>(*this, std::move(callback), paths, since);
   }
 
-  /// Records an event at the next position, which running streams tell at once.
+  /// Records an event at the next position.
   void record(const std::string& path, std::uint32_t flags = 0) {
     events_.push_back({path, flags, ++newest_});
-    for (Stream* stream : running_) stream->tell({});
   }
 
   struct Creation {
@@ -199,41 +198,29 @@ class InMemoryJournal : public platform::EventJournal {
    public:
     Stream(InMemoryJournal& journal, platform::JournalCallback callback, std::vector<std::string> paths,
            platform::EventID since)
-        : journal_(journal), callback_(std::move(callback)), paths_(std::move(paths)), told_(since) {
+        : journal_(journal), callback_(std::move(callback)), paths_(std::move(paths)), since_(since) {
       ++journal_.liveStreams;
     }
-    ~Stream() override {
-      std::erase(journal_.running_, this);
-      --journal_.liveStreams;
-    }
+    ~Stream() override { --journal_.liveStreams; }
 
     void setQueue(platform::SerialQueue& queue) override { queue_ = &queue; }
     bool start() override {
       if (journal_.refuseStart || !queue_) return false;
-      journal_.running_.push_back(this);
-      std::vector<platform::JournalEvent> end;
-      if (journal_.historyEnds) end.push_back({"", platform::event_flags::historyDone, journal_.newest_});
-      tell(std::move(end));
-      return true;
-    }
-    void stop() override { *isClosed_ = true; }
-    void invalidate() override { *isClosed_ = true; }
-
-    /// What was recorded since the last time, and `further` events.
-    void tell(std::vector<platform::JournalEvent> further) {
       const auto isWatched = [this](const platform::JournalEvent& event) {
-        return event.eventID > told_ && std::any_of(paths_.begin(), paths_.end(), [&](const auto& path) {
+        return event.eventID > since_ && std::any_of(paths_.begin(), paths_.end(), [&](const auto& path) {
                  return isIn(event.path, path) || isIn(path, event.path);
                });
       };
       std::vector<platform::JournalEvent> batch;
       std::copy_if(journal_.events_.begin(), journal_.events_.end(), std::back_inserter(batch), isWatched);
-      batch.insert(batch.end(), further.begin(), further.end());
-      told_ = journal_.newest_;
+      if (journal_.historyEnds) batch.push_back({"", platform::event_flags::historyDone, journal_.newest_});
       queue_->async([isClosed = isClosed_, callback = callback_, batch = std::move(batch)] {
         if (!*isClosed) callback(batch);
       });
+      return true;
     }
+    void stop() override { *isClosed_ = true; }
+    void invalidate() override { *isClosed_ = true; }
 
    private:
     static bool isIn(const std::string& path, const std::string& directory) {
@@ -243,14 +230,13 @@ class InMemoryJournal : public platform::EventJournal {
     InMemoryJournal& journal_;
     const platform::JournalCallback callback_;
     const std::vector<std::string> paths_;
-    platform::EventID told_;
+    const platform::EventID since_;
     platform::SerialQueue* queue_ = nullptr;
     const std::shared_ptr<std::atomic<bool>> isClosed_ = std::make_shared<std::atomic<bool>>(false);
   };
 
   platform::EventID newest_ = 1000;
   std::vector<platform::JournalEvent> events_;
-  std::vector<Stream*> running_;
 };
 
 /// A process whose main loop runs a test's work and then returns.

@@ -16,10 +16,10 @@ std::string recordDirectory(const RuntimeDirectory& runtime) {
   return runtime.path ? joinPath(*runtime.path, "beacond") : "/dev/null/beacond";
 }
 
-JournalOptions journalOptions(const std::optional<std::string>& stateDirectory,
-                              std::vector<std::string> applicationDirectories) {
+JournalOptions journalOptions(const std::optional<std::string>& stateDirectory, std::string home) {
   JournalOptions options;
-  options.applicationDirectories = std::move(applicationDirectories);
+  options.applicationDirectories = LinuxApplicationRegistry::applicationDirectories(home);
+  options.limits.home = std::move(home);
   // Half of what the user may watch is left to the user's other programs.
   const auto most = readSmallFile(AT_FDCWD, "/proc/sys/fs/inotify/max_user_watches");
   std::size_t mostOfUser = 0;
@@ -44,9 +44,8 @@ LinuxPlatform::LinuxPlatform()
       seeds_(recordDirectory(runtimeDirectory_), log_),
       publication_(files_, log_, directories_.stateDirectory()),
       preferences_(files_, directories_.stateDirectory(), directories_.configurationDirectory()),
-      journal_(journalOptions(directories_.stateDirectory(),
-                              LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory())),
-               files_, log_, concurrentQueue_),
+      journal_(journalOptions(directories_.stateDirectory(), directories_.homeDirectory()), files_, log_,
+               concurrentQueue_),
       applications_(files_, log_, concurrentQueue_,
                     LinuxApplicationRegistry::applicationDirectories(directories_.homeDirectory()),
                     directories_.stateDirectory(), &journal_),

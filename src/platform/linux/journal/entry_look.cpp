@@ -1,12 +1,12 @@
 #include "platform/linux/journal/entry_look.h"
 
-#include <array>
+#include <algorithm>
 #include <cerrno>
-#include <climits>
 #include <ctime>
 #include <fcntl.h>
-#include <optional>
+#include <linux/magic.h>
 #include <sys/stat.h>
+#include <sys/statfs.h>
 #include <sys/sysmacros.h>
 
 #include "platform/linux/files/files.h"
@@ -23,60 +23,53 @@ EntryKind kindOf(mode_t mode) {
   return S_ISLNK(mode) ? EntryKind::Link : EntryKind::Other;
 }
 
-EntryStatus look(int directory, const char* name, int flags, std::uint64_t* device = nullptr) {
-  struct statx found {};
-  constexpr unsigned wanted = STATX_TYPE | STATX_NLINK | STATX_INO | STATX_CTIME | STATX_MTIME | STATX_SIZE;
-  EntryStatus status;
-  if (statx(directory, name, flags | AT_NO_AUTOMOUNT, wanted, &found) != 0) {
-    status.size = static_cast<std::uint64_t>(errno);
-    return status;
-  }
-  const auto nanoseconds = [](const statx_timestamp& time) {
-    // Wraps around in the far future, which anyone may give a file.
-    return static_cast<std::int64_t>(static_cast<std::uint64_t>(time.tv_sec) * nanosecondsPerSecond +
-                                     time.tv_nsec);
-  };
-  status.kind = kindOf(found.stx_mode);
-  status.hasOtherNames = status.kind == EntryKind::File && found.stx_nlink > 1;
-  status.inode = found.stx_ino;
-  status.changed = nanoseconds(found.stx_ctime);
-  status.modified = nanoseconds(found.stx_mtime);
-  status.size = found.stx_size;
-  if (device) *device = makedev(found.stx_dev_major, found.stx_dev_minor);
-  return status;
+std::int64_t nanoseconds(const statx_timestamp& time) {
+  // Wraps around in the far future, which anyone may give a file.
+  return static_cast<std::int64_t>(static_cast<std::uint64_t>(time.tv_sec) * nanosecondsPerSecond +
+                                   time.tv_nsec);
 }
 
-/// Link text and contents; absent when there is too much of them, or they cannot be read.
-std::optional<Digest> digestOf(int directory, const char* name, const EntryRecord& record) {
-  constexpr std::size_t largest = 1024 * 1024;
-  Bytes bytes;
-  if (record.isLink()) {
-    std::array<char, PATH_MAX> text;
-    const ssize_t length = readlinkat(directory, name, text.data(), text.size());
-    if (length < 0) return std::nullopt;
-    bytes.assign(text.begin(), text.begin() + length);
-    bytes.push_back(0);
+/// False when the status cannot be had; the reason is in it.
+bool look(int directory, const char* name, int flags, EntryLook& result) {
+  struct statx found {};
+  constexpr unsigned wanted = STATX_TYPE | STATX_MODE | STATX_UID | STATX_GID | STATX_INO | STATX_CTIME |
+                              STATX_MTIME | STATX_SIZE | STATX_MNT_ID;
+  if (statx(directory, name, flags | AT_NO_AUTOMOUNT, wanted, &found) != 0) {
+    result.status = {};
+    result.status.size = static_cast<std::uint64_t>(errno);
+    return false;
   }
-  if ((record.isLink() ? record.target : record.status).kind == EntryKind::File) {
-    const auto contents = readFile(directory, name, largest);
-    if (!contents) return std::nullopt;
-    bytes.insert(bytes.end(), contents->begin(), contents->end());
+  result.status = {kindOf(found.stx_mode), found.stx_ino, nanoseconds(found.stx_ctime),
+                   nanoseconds(found.stx_mtime), found.stx_size};
+  result.device = makedev(found.stx_dev_major, found.stx_dev_minor);
+  result.mount = (found.stx_mask & STATX_MNT_ID) ? found.stx_mnt_id : 0;
+  for (const std::uint32_t part : {std::uint32_t(found.stx_mode), found.stx_uid, found.stx_gid}) {
+    result.attributes.append(std::to_string(part)).append(1, ' ');
   }
-  return md5(bytes);
+  return true;
+}
+
+/// Local file systems, on which whatever is changed is changed through this kernel, told, and stamped in the
+/// directory, too. Those of removable media are none: other machines change them, and their roots bear no
+/// stamps.
+bool notifiesOfEveryChange(std::uint64_t magic) {
+  static constexpr std::uint64_t local[] = {
+      EXT4_SUPER_MAGIC,     XFS_SUPER_MAGIC, BTRFS_SUPER_MAGIC,    TMPFS_MAGIC,
+      F2FS_SUPER_MAGIC,     RAMFS_MAGIC,     0x2fc12fc1 /* ZFS */, 0xca451a4e /* bcachefs */,
+      REISERFS_SUPER_MAGIC, 0x3153464a /* JFS */};
+  return std::find(std::begin(local), std::end(local), magic) != std::end(local);
 }
 
 }  // namespace
 
-EntryRecord lookAtEntry(int directory, const char* name) {
-  EntryRecord record;
-  record.isKnown = true;
-  record.status = look(directory, name, AT_SYMLINK_NOFOLLOW);
-  if (record.isLink()) record.target = look(directory, name, 0);
-  // Its times change with its names, which are looked at when it is listed.
-  for (EntryStatus* status : {&record.status, &record.target}) {
-    if (status->kind == EntryKind::Directory) *status = {EntryKind::Directory, false, status->inode, 0, 0, 0};
-  }
-  return record;
+EntryLook lookAtEntry(const std::string& path) {
+  EntryLook result;
+  if (!look(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, result)) return result;
+  if (result.status.kind != EntryKind::Link) return result;
+  result.link = result.status;
+  result.device = result.mount = 0;
+  look(AT_FDCWD, path.c_str(), 0, result);
+  return result;
 }
 
 std::int64_t timeStampNow() {
@@ -85,33 +78,31 @@ std::int64_t timeStampNow() {
   return static_cast<std::int64_t>(now.tv_sec) * nanosecondsPerSecond + now.tv_nsec;
 }
 
-EntryRecord takeRecord(int directory, const char* name, const EntryRecord* before,
-                       const RecordTaking& taking) {
-  constexpr int attempts = 3;
-  EntryRecord record = lookAtEntry(directory, name);
-  for (int attempt = 0; attempt < attempts; ++attempt) {
-    // A link may lead to another file system, whose clock nobody here knows.
-    const TimeStamps stamps = record.isLink() ? TimeStamps::Foreign : taking.stamps;
-    const auto racy = [&taking, stamps](const EntryStatus& status) {
-      return status.kind != EntryKind::Unknown && status.kind != EntryKind::Directory &&
-             isRacy(status.changed, taking.now, stamps);
-    };
-    record.isRacy = racy(record.status) || racy(record.target);
-    const bool isWanted = record.isRacy && (taking.digestIfRacy || changesUnseen(record));
-    if (!isWanted && !(before && before->digest)) return record;
-    if (std::chrono::steady_clock::now() > taking.deadline) return record;
-    record.digest = digestOf(directory, name, record);
-    // Only when nothing changed around the reading do the two belong together.
-    const EntryRecord after = lookAtEntry(directory, name);
-    if (after.status == record.status && after.target == record.target) return record;
-    record = after;
+FileSystemTraits FileSystems::traits(std::uint64_t device, const std::string& path) {
+  {
+    const std::lock_guard lock(mutex_);
+    if (const auto known = known_.find(device); known != known_.end()) return known->second;
   }
-  record.isRacy = true;
-  return record;
+  const OwnedDescriptor opened = openFile(AT_FDCWD, path, O_PATH);
+  struct statfs status {};
+  EntryLook now;
+  // The path may lead elsewhere by now: then nothing is known, and asked again the next time.
+  const bool isIt = opened && look(opened.get(), "", AT_EMPTY_PATH, now) && now.device == device &&
+                    fstatfs(opened.get(), &status) == 0;
+  if (!isIt) return {};
+  FileSystemTraits traits;
+  static_assert(sizeof status.f_fsid == sizeof traits.identity);
+  std::copy_n(reinterpret_cast<const char*>(&status.f_fsid), sizeof traits.identity,
+              reinterpret_cast<char*>(&traits.identity));
+  traits.notifies = notifiesOfEveryChange(static_cast<std::uint64_t>(status.f_type));
+  const std::lock_guard lock(mutex_);
+  known_.emplace(device, traits);
+  return traits;
 }
 
-EntryStatus statusOf(int descriptor, std::uint64_t& device) {
-  return look(descriptor, "", AT_EMPTY_PATH, &device);
+void FileSystems::forget() {
+  const std::lock_guard lock(mutex_);
+  known_.clear();
 }
 
 }  // namespace kel::platform

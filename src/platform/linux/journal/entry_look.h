@@ -1,34 +1,50 @@
 #pragma once
 
-#include <chrono>
 #include <cstdint>
+#include <mutex>
+#include <string>
+#include <unordered_map>
 
 #include "platform/linux/journal/entry_record.h"
 
-// Taking records of what is on the disk.
+// Looking at what is on the disk. Any thread.
 namespace kel::platform {
 
-/// Looks at `name` in `directory`: at a link and at what it leads to. Of a directory only kind and inode.
-EntryRecord lookAtEntry(int directory, const char* name);
+/// What one look at a path tells.
+struct EntryLook {
+  EntryStatus status;        ///< links followed
+  EntryStatus link;          ///< the link's own, when the path ends in one; else of unknown kind
+  std::uint64_t device = 0;  ///< of what `status` tells
+  std::uint64_t mount = 0;
+  std::string attributes;  ///< mode and owners, as text
+
+  bool isLink() const { return link.kind != EntryKind::Unknown; }
+};
+
+/// Looks at `path`: one system call, and a second for a link.
+EntryLook lookAtEntry(const std::string& path);
 
 /// The time that local file systems stamp changes with, in nanoseconds.
 std::int64_t timeStampNow();
 
-/// How to take a record.
-struct RecordTaking {
-  std::int64_t now = 0;  ///< `timeStampNow`, from before the look
-  TimeStamps stamps = TimeStamps::Local;
-  bool digestIfRacy = true;  ///< also of what a watch tells the changes of
-  std::chrono::steady_clock::time_point deadline = std::chrono::steady_clock::time_point::max();
+/// What is known of a file system.
+struct FileSystemTraits {
+  std::uint64_t identity = 0;  ///< as far as it has one
+  bool notifies = false;       ///< whatever is changed is changed through this kernel, and told
 };
 
-/// Looks at `name` in `directory`, at a link and at what it leads to. `before` is the last record, absent for
-/// a new entry: one with a digest gets a digest again, so that the two can be compared. Never waits for a
-/// FIFO or a device and reads at most 1 MiB, and nothing after the deadline.
-EntryRecord takeRecord(int directory, const char* name, const EntryRecord* before,
-                       const RecordTaking& taking);
+/// The file systems that were met, by device, so that each is asked once. Any thread.
+class FileSystems {
+ public:
+  /// Those of the file system that holds `path` and had the number `device` a moment ago.
+  FileSystemTraits traits(std::uint64_t device, const std::string& path);
 
-/// The status of an open file or directory; of unknown kind when it cannot be had. `device` is set with it.
-EntryStatus statusOf(int descriptor, std::uint64_t& device);
+  /// After a mount the numbers may be those of others.
+  void forget();
+
+ private:
+  std::mutex mutex_;
+  std::unordered_map<std::uint64_t, FileSystemTraits> known_;
+};
 
 }  // namespace kel::platform

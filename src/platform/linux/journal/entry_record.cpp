@@ -13,15 +13,21 @@ bool isRacy(std::int64_t changed, std::int64_t now, TimeStamps stamps) {
   return changed > now - (changed % 10'000'000 == 0 ? coarse : tick);
 }
 
-bool isUnchanged(const EntryRecord& before, const EntryRecord& now) {
-  if (!before.isKnown || !(before.status == now.status) || !(before.target == now.target)) return false;
-  return !before.isRacy || (before.digest && before.digest == now.digest);
+bool isSameEntry(const EntryRecord& before, const EntryRecord& now) {
+  return before.isKnown && before.status.kind == now.status.kind && before.status.inode == now.status.inode &&
+         before.link == now.link && before.fileSystem == now.fileSystem && before.mount == now.mount;
 }
 
-bool changesUnseen(const EntryRecord& record) { return record.isLink() || record.status.hasOtherNames; }
+bool isAlike(const EntryRecord& before, const EntryRecord& now) {
+  return isSameEntry(before, now) && before.status == now.status;
+}
+
+bool isUnchanged(const EntryRecord& before, const EntryRecord& now) {
+  return isAlike(before, now) && (!before.isRacy || (before.digest && before.digest == now.digest));
+}
 
 void writeStatus(ByteWriter& writer, const EntryStatus& status) {
-  writer.number(static_cast<unsigned>(status.kind) << 1 | (status.hasOtherNames ? 1u : 0u));
+  writer.number(static_cast<unsigned>(status.kind));
   writer.number(status.inode);
   writer.fixed(static_cast<std::uint64_t>(status.changed));
   writer.fixed(static_cast<std::uint64_t>(status.modified));
@@ -31,9 +37,8 @@ void writeStatus(ByteWriter& writer, const EntryStatus& status) {
 EntryStatus readStatus(ByteReader& reader) {
   EntryStatus status;
   const std::uint64_t kind = reader.number();
-  if (kind >> 1 > static_cast<unsigned>(EntryKind::Other)) reader.fail();
-  status.kind = reader.failed() ? EntryKind::Unknown : static_cast<EntryKind>(kind >> 1);
-  status.hasOtherNames = (kind & 1) != 0;
+  if (kind > static_cast<unsigned>(EntryKind::Other)) reader.fail();
+  status.kind = reader.failed() ? EntryKind::Unknown : static_cast<EntryKind>(kind);
   status.inode = reader.number();
   status.changed = static_cast<std::int64_t>(reader.fixed());
   status.modified = static_cast<std::int64_t>(reader.fixed());

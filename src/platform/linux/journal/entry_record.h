@@ -17,7 +17,6 @@ enum class EntryKind : std::uint8_t { Unknown, File, Directory, Link, Other };
 /// compared for equality: clocks are set back. Of an unknown entry `size` is the error number that says why.
 struct EntryStatus {
   EntryKind kind = EntryKind::Unknown;
-  bool hasOtherNames = false;  ///< further hard links, through which it can change unseen
   std::uint64_t inode = 0;
   std::int64_t changed = 0;
   std::int64_t modified = 0;
@@ -28,17 +27,16 @@ struct EntryStatus {
 
 /// What is remembered of an entry, to find out later whether it changed.
 struct EntryRecord {
-  EntryStatus status;    ///< a link's own
-  EntryStatus target;    ///< of a link: what it leads to; of a directory only kind and inode
-  bool isKnown = false;  ///< false: nothing can be told from this record
-  bool isRacy = false;   ///< taken so soon after a change that the next one may leave the status alike
-  std::optional<Digest> digest;  ///< of a racy entry: link text and contents, when they were worth reading
+  EntryStatus status;            ///< links followed
+  EntryStatus link;              ///< the link's own, when the entry is one; else of unknown kind
+  std::uint64_t fileSystem = 0;  ///< identity of the file system of what `status` tells, as far as it has one
+  std::uint64_t mount = 0;       ///< the mount through which that was reached
+  bool isKnown = false;          ///< false: nothing can be told from this record
+  bool isRacy = false;  ///< taken so soon after a change that the next one may leave the status alike
+  std::optional<Digest> digest;  ///< of a racy entry: attributes, link text and contents, when readable
 
   bool isDirectory() const { return status.kind == EntryKind::Directory; }
-  bool isLink() const { return status.kind == EntryKind::Link; }
-  bool leadsToDirectory() const { return isDirectory() || (isLink() && target.kind == EntryKind::Directory); }
-
-  bool operator==(const EntryRecord&) const = default;
+  bool isLink() const { return link.kind != EntryKind::Unknown; }
 };
 
 /// How far the times of a file system can be trusted.
@@ -51,9 +49,11 @@ enum class TimeStamps : std::uint8_t {
 /// was looked at, not before `now`, within the granularity of its file system's clock.
 bool isRacy(std::int64_t changed, std::int64_t now, TimeStamps stamps);
 
-/// True when the entry is one whose changes no watch of its directory tells: a link, or a file with further
-/// names.
-bool changesUnseen(const EntryRecord& record);
+/// True when both are of the same file, directory or absence, reached in the same way.
+bool isSameEntry(const EntryRecord& before, const EntryRecord& now);
+
+/// True when everything but the contents is alike.
+bool isAlike(const EntryRecord& before, const EntryRecord& now);
 
 /// True when nothing can have changed between the two records.
 bool isUnchanged(const EntryRecord& before, const EntryRecord& now);

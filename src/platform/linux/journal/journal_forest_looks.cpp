@@ -1,175 +1,174 @@
+#include <algorithm>
+#include <atomic>
 #include <cerrno>
-#include <utility>
+#include <string>
 
 #include "platform/linux/files/files.h"
 #include "platform/linux/journal/journal_forest.h"
 
 namespace kel::platform {
 
-namespace {
-
-std::size_t countBelow(const JournalNode& node, std::size_t most) {
-  std::size_t count = 0;
-  if (!node.directory) return count;
-  for (const auto& [name, child] : node.directory->children) {
-    count += (child->isGone ? 0 : 1) + countBelow(*child, most);
-    if (count > most) break;
+bool JournalForest::lookAtSome(LookMode mode, std::chrono::steady_clock::time_point deadline) {
+  const std::vector<JournalNode*> nodes = nextBatch();
+  if (nodes.empty()) {
+    noteHorizons();
+    return false;
   }
-  return count;
+  std::vector<RecordLook> looks = takeLooks(nodes, mode, deadline);
+  const EventID id = newID_();
+  bool isLate = true;
+  for (std::size_t at = 0; at < nodes.size(); ++at) {
+    if (!looks[at].isTaken) continue;
+    isLate = false;
+    install(*nodes[at], looks[at], id);
+  }
+  removeUnusedWatches();
+  for (const auto& tree : trees_) {
+    if (tree->goneCount > limits_.mostGone) tree->forgetGone(id);
+  }
+  return !isLate && std::chrono::steady_clock::now() < deadline;
 }
 
-/// The end of the lines in the system log about entries whose changes cannot be told. Only the first entry of
-/// each kind gets a line.
-constexpr const char* unknowable = "; such entries count as changed whenever they are asked about";
-
-/// True when the path leads nowhere, as opposed to where one cannot look.
-bool meansMissing(int error) { return error == ENOENT || error == ENOTDIR; }
-
-}  // namespace
-
-void JournalForest::install(DirectoryLook& look, EventID id) {
-  JournalNode& node = *look.node;
-  const bool isDoubted = std::exchange(node.isDoubted, false);
-  if (look.hasRecord) {
-    const bool led = node.record.leadsToDirectory() && node.record.target.inode == look.record.target.inode;
-    installRecord(node, std::move(look.record), isDoubted || !isCovered(*node.parent), id);
-    if (node.isBoundless && isAsked_) JournalTree::markChanged(node, id);
-    if (!led) return;  // what it leads to now has been queued
+/// Some of what is doubted and has nothing doubted above it: a watch on a directory comes before the look at
+/// what is in it, and what vanishes with a parent is in no batch together with it.
+std::vector<JournalNode*> JournalForest::nextBatch() const {
+  constexpr std::size_t most = 1024;
+  std::vector<JournalNode*> nodes;
+  for (JournalNode* node : doubted_) {
+    const JournalNode* above = node->parent;
+    while (above && above->state != RecordState::Doubted) above = above->parent;
+    if (!above) nodes.push_back(node);
+    if (nodes.size() == most) break;
   }
-  if (look.isListing && node.directory) installListing(look, isDoubted, id);
+  return nodes;
 }
 
-void JournalForest::installRecord(JournalNode& node, EntryRecord record, bool isDoubted, EventID id) {
-  const EntryRecord before = std::exchange(node.record, std::move(record));
-  const EntryRecord& now = node.record;
-  // Of other entries an event has told already.
-  const bool isUntold = isDoubted || changesUnseen(before) || changesUnseen(now);
-  if (isUntold && !isUnchanged(before, now)) {
-    JournalTree::markChanged(node, id);
-    if (isDoubted) hint(*node.tree);
+std::vector<RecordLook> JournalForest::takeLooks(const std::vector<JournalNode*>& nodes, LookMode mode,
+                                                 std::chrono::steady_clock::time_point deadline) {
+  const auto watched = static_cast<std::int64_t>(watches_.size());
+  std::atomic<std::int64_t> watchesLeft = static_cast<std::int64_t>(limits_.mostWatches) - watched;
+  constexpr std::chrono::milliseconds portion{10};
+  if (mode == LookMode::InBackground) {
+    deadline = std::min(deadline, std::chrono::steady_clock::now() + portion);
   }
-  const bool isSameDirectory = before.leadsToDirectory() && now.leadsToDirectory() &&
-                               before.status.kind == now.status.kind &&
-                               before.target.inode == now.target.inode;
-  if (!isSameDirectory) {
-    node.isBoundless = false;
-    releaseBelow(node);
-    if (node.directory) setWatch(node, -1);
-    node.directory.reset();
-    if (now.leadsToDirectory()) {
-      node.directory = std::make_unique<JournalDirectory>();
-      enqueue(node, false);
+  const LookSettings settings{fileSystems_, inotify_.get(), watchesLeft, deadline};
+  std::vector<RecordLook> looks(nodes.size());
+  // A share of several is worth the hand-over to another thread.
+  constexpr std::size_t share = 32;
+  const auto lookAtShare = [&](std::size_t index) {
+    const std::size_t end = std::min(nodes.size(), (index + 1) * share);
+    for (std::size_t at = index * share; at < end; ++at) {
+      looks[at] = lookAt(*nodes[at], nodes[at]->tree->pathOf(*nodes[at]), settings);
     }
+  };
+  const std::size_t shares = (nodes.size() + share - 1) / share;
+  if (mode == LookMode::InParallel && shares > 1) {
+    pool_.apply(shares, lookAtShare);
+  } else {
+    for (std::size_t index = 0; index < shares; ++index) lookAtShare(index);
   }
-  if (now.isRacy && !now.digest) unsettled_.insert(&node);
-  updateCover(node);
+  return looks;
 }
 
-void JournalForest::installListing(DirectoryLook& look, bool isDoubted, EventID id) {
-  JournalNode& node = *look.node;
-  JournalDirectory& directory = *node.directory;
-  // Only what was watched all the time has its changes told by events.
-  isDoubted |= !isCovered(node) || directory.watch != look.watch;
-  setWatch(node, look.watch);
-  if (look.watchError == ENOSPC || look.watchError == ENOMEM) {
-    reportOnce(exhaustionReported_,
+void JournalForest::install(JournalNode& node, RecordLook& look, EventID id) {
+  JournalTree& tree = *node.tree;
+  if (look.watchError != 0) {
+    reportOnce(watchesReported_,
                "Cannot watch all directories, changes in the others are found by looking: " +
                    errorText(look.watchError));
   }
-  if (look.error != 0) return installFailure(look, id);
-  if (!node.parent) {
-    node.tree->device = look.device;
-    node.tree->inode = look.own.inode;
+  const EntryRecord& now = look.record;
+  const bool isMissing = now.status.kind == EntryKind::Unknown && !now.isLink() && now.status.size == ENOENT;
+  if (isMissing && node.parent && node.role != RecordRole::Information) {
+    if (look.watch >= 0) watchesToRemove_.push_back(look.watch);
+    return bury(node, id);
   }
-  const EntryStatus before = directory.listing;
-  const EventID latest = node.latest;
-  const bool isReplaced =
-      before.kind != EntryKind::Unknown &&
-      (before.inode != look.own.inode || directory.fileSystem != look.fileSystem.identity);
-  const bool isChanged = isReplaced || directory.error != 0;
-  if (isChanged) {
-    JournalTree::markChanged(node, id);
-  } else if (isDoubted && before.kind != EntryKind::Unknown && !(before == look.own)) {
-    JournalTree::markListed(node, id);
+  const bool isOther = !isSameEntry(node.record, now);
+  if (look.differs) {
+    const bool isListOnly = node.role == RecordRole::Folder && !isOther;
+    isListOnly ? JournalTree::markListed(node, id) : JournalTree::markChanged(node, id);
+    hint(tree);
   }
-  installNames(look, isDoubted || isChanged, id);
-  const bool wasKnown = isChanged || before.kind != EntryKind::Unknown;
-  if (isDoubted && wasKnown && node.latest != latest) hint(*node.tree);
-  directory.listing = look.own;
-  directory.listingIsSound = !look.ownIsRacy && look.fileSystem.notifies;
-  directory.fileSystem = look.fileSystem.identity;
-  directory.notifies = look.fileSystem.notifies;
-  directory.error = 0;
-  if (look.ownIsRacy) unsettled_.insert(&node);
-  updateCover(node);
-  enforceLimits(node);
+  if (!node.parent) installRoot(node, look);
+  const bool doubtsChildren = isOther || node.tells != look.tells;
+  node.record = std::move(look.record);
+  setWatch(node, look.watch);
+  if (!node.record.isDirectory()) {
+    releaseBelow(node);
+  } else if (node.role == RecordRole::Folder) {
+    installNames(node, look, id);
+  } else if (node.role == RecordRole::Bundle && node.children.empty()) {
+    doubt(tree.add(node, JournalTree::informationName, RecordRole::Information));
+  }
+  if (doubtsChildren) {
+    for (const auto& [name, child] : node.children) doubtBelow(*child);
+  }
+  settle(node, look);
 }
 
-void JournalForest::installFailure(DirectoryLook& look, EventID id) {
-  JournalNode& node = *look.node;
-  JournalDirectory& directory = *node.directory;
-  if (look.error == E2BIG) {
-    noteTooLarge(*node.tree);
-    return enqueue(node, true);
-  }
-  // Where one cannot look everything may have changed, whenever it is asked about.
-  const bool wasThere = directory.error == 0 && directory.listing.kind != EntryKind::Unknown;
-  const bool isMissingRoot = !node.parent && meansMissing(look.error);
-  if (wasThere || directory.error != look.error || (!meansMissing(look.error) && isAsked_)) {
-    const bool isFirstLook = isMissingRoot && directory.error == 0 && !wasThere;
-    if (!isFirstLook) JournalTree::markChanged(node, id);
-    if (!isFirstLook && directory.error != look.error) hint(*node.tree);
-  }
-  if (!meansMissing(look.error)) {
-    reportOnce(unreadableReported_, errorLine(node.tree->pathOf(node), look.error) + unknowable);
-  }
-  releaseBelow(node);
-  directory.listing = {};
-  directory.listingIsSound = false;
-  directory.error = look.error;
-  if (!node.parent) {
-    node.tree->device = isMissingRoot ? 0 : look.device;
-    node.tree->inode = 0;
-  }
-  updateCover(node);
+void JournalForest::installRoot(JournalNode& root, RecordLook& look) {
+  JournalTree& tree = *root.tree;
+  if (look.chain == tree.chain) return;
+  // By another way to what may be the same: nothing that was known of it counts.
+  if (!tree.chain.empty() && !look.chain.empty()) tree.horizon = JournalTree::noHorizon;
+  tree.chain = std::move(look.chain);
+  tree.approachChanged = true;
 }
 
-void JournalForest::installNames(DirectoryLook& look, bool isDoubted, EventID id) {
-  JournalNode& node = *look.node;
-  for (auto& [child, record] : look.recorded) {
-    installRecord(*child, std::move(record), isDoubted, id);
+void JournalForest::installNames(JournalNode& folder, const RecordLook& look, EventID id) {
+  JournalTree& tree = *folder.tree;
+  if (look.listingError != 0) {
+    // Unlike what comes next, so that it counts as changed as long as it cannot be listed.
+    folder.record.isRacy = true;
+    folder.record.digest.reset();
   }
-  for (JournalNode* child : look.gone) {
-    release(*child);
-    node.tree->bury(*child, id);
-  }
-  for (auto& [name, record] : look.added) {
-    const auto known = node.directory->children.find(name);
-    if (known != node.directory->children.end()) {
-      release(*known->second);
-      known->second->directory.reset();
+  if (!look.isListed) return;
+  auto name = look.names.begin();
+  std::vector<JournalNode*> vanished;
+  std::vector<std::pair<const ListedName*, RecordRole>> appeared;
+  const auto passNames = [&](const std::string* before) {
+    for (; name != look.names.end() && (!before || name->name < *before); ++name) {
+      if (const auto role = tree.roleOf(folder, *name)) appeared.emplace_back(&*name, *role);
     }
-    JournalNode& child = node.tree->add(node, name, {});
-    installRecord(child, std::move(record), false, id);
-    JournalTree::markChanged(child, id);
+  };
+  for (const auto& [known, child] : folder.children) {
+    passNames(&known);
+    const bool isListed = name != look.names.end() && name->name == known;
+    const auto role = isListed ? tree.roleOf(folder, *name) : std::nullopt;
+    if (role && child->state == RecordState::Gone) appeared.emplace_back(&*name, *role);
+    if (!role && child->state != RecordState::Gone) vanished.push_back(child.get());
+    if (isListed) ++name;
   }
-  for (JournalNode* child : look.suspected) enqueue(*child, true);
-  if (!look.gone.empty() || !look.added.empty()) JournalTree::markListed(node, id);
+  passNames(nullptr);
+  for (JournalNode* node : vanished) bury(*node, id);
+  for (const auto& [listed, role] : appeared) {
+    tree.isTooLarge = tree.isTooLarge || tree.nodeCount >= limits_.mostRecords;
+    if (tree.isTooLarge) break;
+    JournalNode& node = tree.add(folder, listed->name, role);
+    JournalTree::markChanged(node, id);
+    doubted_.insert(&node);
+  }
+  if (tree.isTooLarge) reportOnce(sizeReported_, tree.path() + ": too many entries to tell what changed");
 }
 
-void JournalForest::enforceLimits(JournalNode& directory) {
-  JournalTree& tree = *directory.tree;
-  JournalNode* link = outermostLink(directory);
-  if (link && countBelow(*link, limits_.mostBehindLink) > limits_.mostBehindLink) {
-    becomeEmptyDirectory(*link);
-    link->isBoundless = true;
-    // What was just found below it is forgotten before it could be told.
-    JournalTree::markChanged(*link, newID_());
-    reportOnce(boundlessReported_, tree.pathOf(*link) + ": leads to too much" + unknowable);
-    updateCover(*link);
+/// From Doubted to Covered or Uncovered.
+void JournalForest::settle(JournalNode& node, const RecordLook& look) {
+  const EntryStatus& status = node.record.status;
+  node.tells = look.tells && node.watch >= 0;
+  const bool isAbsent = status.kind == EntryKind::Unknown && status.size == ENOENT;
+  const bool isCovered = (node.tells || isAbsent) && !node.record.isLink() && look.listingError == 0 &&
+                         (!node.parent || node.parent->tells);
+  doubted_.erase(&node);
+  --node.tree->doubtedCount;
+  node.state = isCovered ? RecordState::Covered : RecordState::Uncovered;
+  // A root is looked at for every question anyway.
+  if (!isCovered && node.parent) uncovered_.insert(&node);
+}
+
+void JournalForest::noteHorizons() {
+  for (const auto& tree : trees_) {
+    if (tree->horizon == JournalTree::noHorizon && tree->doubtedCount == 0) tree->horizon = newID_();
   }
-  if (tree.nodeCount > limits_.mostEntries) noteTooLarge(tree);
-  if (tree.vanishedCount > limits_.mostVanished) tree.forgetVanished(newID_());
 }
 
 }  // namespace kel::platform

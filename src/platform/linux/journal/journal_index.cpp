@@ -1,7 +1,6 @@
 #include "platform/linux/journal/journal_index.h"
 
 #include <algorithm>
-#include <limits>
 #include <utility>
 
 #include "platform/linux/files/sealed_bytes.h"
@@ -10,14 +9,13 @@ namespace kel::platform {
 
 namespace {
 
-// A path is at most 4096 bytes long, so no directory that can be reached lies deeper.
-constexpr int deepest = 2048;
-
 enum Flag : unsigned {
   isKnown = 0x1,
   isRacy = 0x2,
   isGone = 0x4,
-  isSound = 0x10,
+  isLink = 0x8,
+  hasDigest = 0x10,
+  isBundle = 0x20,
 };
 
 class TreeWriter {
@@ -28,21 +26,21 @@ class TreeWriter {
     const EntryRecord& record = node.record;
     // A racy entry without a digest could not be told from a changed one.
     const bool known = record.isKnown && !(record.isRacy && !record.digest);
-    const JournalDirectory* directory = node.directory.get();
-    writer_.number((known ? isKnown : 0u) | (record.isRacy ? isRacy : 0u) | (node.isGone ? isGone : 0u) |
-                   (directory && directory->listingIsSound ? isSound : 0u));
-    writeStatus(writer_, record.status);
-    if (record.isLink()) writeStatus(writer_, record.target);
-    writer_.number(record.digest ? 1 : 0);
-    if (record.digest) writer_.bytes(*record.digest);
+    const bool gone = node.state == RecordState::Gone;
+    writer_.number((known ? isKnown : 0u) | (record.isRacy ? isRacy : 0u) | (gone ? isGone : 0u) |
+                   (record.isLink() ? isLink : 0u) | (record.digest ? hasDigest : 0u) |
+                   (node.role == RecordRole::Bundle ? isBundle : 0u));
     writer_.number(node.changed > horizon_ ? node.changed : 0);
-    if (!directory) return;
-    writeStatus(writer_, directory->listing);
-    writer_.number(static_cast<std::uint64_t>(directory->error));
-    writer_.number(directory->fileSystem);
-    writer_.number(directory->listed > horizon_ ? directory->listed : 0);
-    writer_.number(directory->children.size());
-    for (const auto& [name, child] : directory->children) {
+    if (gone) return;
+    writeStatus(writer_, record.status);
+    writer_.number(record.fileSystem);
+    writer_.number(record.mount);
+    if (record.isLink()) writeStatus(writer_, record.link);
+    if (record.digest) writer_.bytes(*record.digest);
+    if (node.role == RecordRole::Information) return;
+    writer_.number(node.listed > horizon_ ? node.listed : 0);
+    writer_.number(node.children.size());
+    for (const auto& [name, child] : node.children) {
       writer_.string(name);
       write(*child);
     }
@@ -57,52 +55,59 @@ class TreeReader {
  public:
   TreeReader(ByteReader& reader, EventID lastID) : reader_(reader), lastID_(lastID) {}
 
+  /// `node` is a root, or has just been added as a folder.
   void read(JournalNode& node, int depth = 0) {
+    constexpr int deepest = 20;
     const std::uint64_t flags = reader_.number();
-    EntryRecord record;
-    record.isKnown = (flags & isKnown) != 0;
-    record.isRacy = (flags & isRacy) != 0;
-    record.status = readStatus(reader_);
-    if (record.isLink()) record.target = readStatus(reader_);
-    if (reader_.number() != 0) {
-      const BytesView digest = reader_.bytes(sizeof(Digest));
-      record.digest.emplace();
-      std::copy(digest.begin(), digest.end(), record.digest->begin());
+    if (node.parent && node.parent->role == RecordRole::Bundle) {
+      node.role = RecordRole::Information;
+    } else if (flags & isBundle) {
+      node.role = RecordRole::Bundle;
     }
     const EventID changed = readID();
-    const bool leadsToDirectory = record.leadsToDirectory();
-    // A root is a directory, also while it is missing.
-    const bool isPossible = node.parent || (record.isDirectory() && (flags & isGone) == 0);
-    if (depth > deepest || !isPossible) return reader_.fail();
-    node.record = std::move(record);
-    if (flags & isGone) {
-      node.isGone = true;
-      ++node.tree->vanishedCount;
-    } else if (leadsToDirectory) {
-      readDirectory(node, (flags & isSound) != 0, depth);
+    const bool mayBeGone = node.role != RecordRole::Information && node.parent;
+    const bool mayBeBundle = node.role == RecordRole::Bundle && node.parent;
+    if (flags >= 2 * isBundle || depth > deepest || ((flags & isGone) && !mayBeGone) ||
+        ((flags & isBundle) && !mayBeBundle)) {
+      return reader_.fail();
     }
+    if (flags & isGone) return node.tree->bury(node, changed);
+    readRecord(node.record, flags);
     JournalTree::markChanged(node, changed);
+    if (node.role != RecordRole::Information) readChildren(node, depth);
   }
 
  private:
-  void readDirectory(JournalNode& node, bool listingIsSound, int depth) {
-    if (!node.directory) node.directory = std::make_unique<JournalDirectory>();
-    JournalDirectory& directory = *node.directory;
-    node.pending = node.tree->pending.insert(node.tree->pending.end(), &node);
-    directory.listing = readStatus(reader_);
-    directory.listingIsSound = listingIsSound;
-    directory.error = static_cast<int>(reader_.number() & 0xffff);
-    directory.fileSystem = reader_.number();
+  void readRecord(EntryRecord& record, std::uint64_t flags) {
+    record.isKnown = (flags & isKnown) != 0;
+    record.isRacy = (flags & isRacy) != 0;
+    record.status = readStatus(reader_);
+    record.fileSystem = reader_.number();
+    record.mount = reader_.number();
+    if (flags & isLink) {
+      record.link = readStatus(reader_);
+      if (!record.isLink()) reader_.fail();
+    }
+    if (flags & hasDigest) {
+      const BytesView digest = reader_.bytes(sizeof(Digest));
+      std::copy(digest.begin(), digest.end(), record.digest.emplace().begin());
+    }
+  }
+
+  void readChildren(JournalNode& node, int depth) {
     JournalTree::markListed(node, readID());
-    for (std::size_t left = reader_.count(); left > 0 && !reader_.failed(); --left) {
+    const std::size_t count = reader_.count();
+    if (node.role == RecordRole::Bundle && count > 1) return reader_.fail();
+    for (std::size_t left = count; left > 0 && !reader_.failed(); --left) {
       const std::string_view name = reader_.string();
       // Names come in order, as they were written: so they are also different.
-      if (name.empty() || name == "." || name == ".." || name.find('/') != name.npos ||
-          name.find('\0') != name.npos ||
-          (!directory.children.empty() && directory.children.rbegin()->first >= name)) {
+      const bool isInOrder = node.children.empty() || node.children.rbegin()->first < name;
+      const bool isRight = node.role != RecordRole::Bundle || name == JournalTree::informationName;
+      if (!isInOrder || !isRight || name.empty() || name.starts_with('.') || name.find('/') != name.npos ||
+          name.find('\0') != name.npos) {
         return reader_.fail();
       }
-      read(node.tree->add(node, name, {}), depth + 1);
+      read(node.tree->add(node, name, RecordRole::Folder), depth + 1);
     }
   }
 
@@ -124,6 +129,7 @@ Bytes encodeIndex(EventID lastID, const std::vector<std::unique_ptr<JournalTree>
   for (const auto& tree : trees) {
     if (tree->horizon == JournalTree::noHorizon || tree->isTooLarge) continue;
     writer.string(tree->path());
+    writer.string(tree->chain);
     writer.number(tree->horizon);
     TreeWriter(writer, tree->horizon).write(tree->root());
   }
@@ -143,6 +149,7 @@ std::optional<JournalIndex> decodeIndex(BytesView file, const std::vector<Watche
         root != roots.end() && std::none_of(index.trees.begin(), index.trees.end(),
                                             [&](const auto& other) { return other->path() == path; });
     auto tree = std::make_unique<JournalTree>(isWanted ? *root : WatchedRoot{"/", false});
+    tree->chain = reader->string();
     tree->horizon = reader->number();
     if (tree->horizon > index.lastID) reader->fail();
     TreeReader(*reader, index.lastID).read(tree->root());

@@ -9,6 +9,8 @@ namespace kel::platform {
 
 namespace {
 
+constexpr std::string_view applicationSuffix = ".app";
+
 /// Tells the events at and below one node.
 class EventCollection {
  public:
@@ -19,24 +21,15 @@ class EventCollection {
     if (node.latest <= since_) return;
     if (node.changed > since_) {
       // With the trailing "/" the event covers all that is below, and no neighbour of a longer name.
-      const bool coversAll = node.record.leadsToDirectory() || !node.parent;
-      add(coversAll ? path + "/" : path, node.changed);
-      if (coversAll || node.isGone) return;
+      return add(node.role == RecordRole::Information ? path : path + "/", node.changed);
     }
-    if (!node.directory) return;
-    bool namesChanged = node.directory->listed > since_;
+    if (node.listed > since_) add(path + "/.", node.listed);
     const std::size_t length = path.size();
-    for (const auto& [name, child] : node.directory->children) {
-      if (child->latest <= since_) continue;
-      if (!isValidUTF8(name)) {
-        namesChanged = true;
-        continue;
-      }
+    for (const auto& [name, child] : node.children) {
       path.append(1, '/').append(name);
       addFrom(*child, path);
       path.resize(length);
     }
-    if (namesChanged) add(path + "/.", node.latest);
   }
 
   void add(std::string path, EventID id) { events_.push_back({std::move(path), 0, id}); }
@@ -48,18 +41,8 @@ class EventCollection {
 
 }  // namespace
 
-JournalNode* outermostLink(JournalNode& node) {
-  JournalNode* link = nullptr;
-  for (JournalNode* at = &node; at; at = at->parent) {
-    if (at->record.isLink()) link = at;
-  }
-  return link;
-}
-
 JournalTree::JournalTree(WatchedRoot watchedRoot) : watchedRoot_(std::move(watchedRoot)) {
   root_.tree = this;
-  root_.record.status.kind = EntryKind::Directory;
-  root_.directory = std::make_unique<JournalDirectory>();
 }
 
 std::string JournalTree::pathOf(const JournalNode& node) const {
@@ -70,55 +53,74 @@ std::string JournalTree::pathOf(const JournalNode& node) const {
   return path;
 }
 
-JournalNode& JournalTree::add(JournalNode& directory, std::string_view name, EntryRecord record) {
-  auto& children = directory.directory->children;
-  auto place = children.find(name);
-  if (place == children.end()) {
-    place = children.emplace(name, std::make_unique<JournalNode>()).first;
-    place->second->tree = this;
-    place->second->parent = &directory;
-    place->second->name = place->first;
-    ++nodeCount;
+bool JournalTree::decides(std::string_view name, bool isDirectory) const {
+  if (name.empty() || name.starts_with('.') || !isValidUTF8(name)) return false;
+  return !holdsApplications() || isDirectory || name.ends_with(applicationSuffix) || name == informationName;
+}
+
+std::optional<RecordRole> JournalTree::roleOf(const JournalNode& folder, const ListedName& name) const {
+  constexpr int deepest = 16;
+  const bool leadsOn = name.kind == EntryKind::Directory || name.kind == EntryKind::Link;
+  const bool isBundle = !holdsApplications() || name.name.ends_with(applicationSuffix);
+  if (isBundle) return leadsOn ? std::optional(RecordRole::Bundle) : std::nullopt;
+  int depth = 0;
+  for (const JournalNode* at = &folder; at->parent; at = at->parent) ++depth;
+  if (name.kind != EntryKind::Directory || depth >= deepest) return std::nullopt;
+  return RecordRole::Folder;
+}
+
+JournalNode& JournalTree::add(JournalNode& parent, std::string_view name, RecordRole role) {
+  const auto place = parent.children.lower_bound(name);
+  if (place != parent.children.end() && place->first == name) {
+    place->second->state = RecordState::Doubted;
+    place->second->role = role;
+    ++doubtedCount;
+    --goneCount;
+    return *place->second;
   }
-  JournalNode& node = *place->second;
-  if (std::exchange(node.isGone, false)) --vanishedCount;
-  if (record.leadsToDirectory() && !node.directory) node.directory = std::make_unique<JournalDirectory>();
-  node.record = std::move(record);
+  const auto added = parent.children.emplace_hint(place, std::string(name), std::make_unique<JournalNode>());
+  JournalNode& node = *added->second;
+  node.tree = this;
+  node.parent = &parent;
+  node.name = added->first;
+  node.role = role;
+  ++nodeCount;
+  ++doubtedCount;
   return node;
 }
 
 void JournalTree::bury(JournalNode& node, EventID id) {
   clear(node);
-  node.directory.reset();
-  if (!std::exchange(node.isGone, true)) ++vanishedCount;
+  if (node.state == RecordState::Doubted) --doubtedCount;
+  node.state = RecordState::Gone;
+  node.record = {};
+  node.tells = false;
+  node.listed = 0;
+  ++goneCount;
   markChanged(node, id);
 }
 
 void JournalTree::clear(JournalNode& node) {
-  if (!node.directory) return;
-  for (const auto& [name, child] : node.directory->children) {
+  for (const auto& [name, child] : node.children) {
     clear(*child);
-    if (child->isGone) --vanishedCount;
     --nodeCount;
+    if (child->state == RecordState::Gone) --goneCount;
+    if (child->state == RecordState::Doubted) --doubtedCount;
   }
-  node.directory->children.clear();
+  node.children.clear();
 }
 
-void JournalTree::forgetVanished(EventID newHorizon) {
-  forgetVanishedBelow(root_);
-  vanishedCount = 0;
-  forgetBefore(newHorizon);
-}
-
-void JournalTree::forgetBefore(EventID newHorizon) {
+void JournalTree::forgetGone(EventID newHorizon) {
   if (horizon != noHorizon) horizon = std::max(horizon, newHorizon);
+  forgetGoneBelow(root_);
 }
 
-void JournalTree::forgetVanishedBelow(JournalNode& node) {
-  if (!node.directory) return;
-  nodeCount -=
-      std::erase_if(node.directory->children, [](const auto& child) { return child.second->isGone; });
-  for (const auto& [name, child] : node.directory->children) forgetVanishedBelow(*child);
+void JournalTree::forgetGoneBelow(JournalNode& node) {
+  const std::size_t forgotten = std::erase_if(
+      node.children, [](const auto& child) { return child.second->state == RecordState::Gone; });
+  nodeCount -= forgotten;
+  goneCount -= forgotten;
+  for (const auto& [name, child] : node.children) forgetGoneBelow(*child);
 }
 
 void JournalTree::markChanged(JournalNode& node, EventID id) {
@@ -127,7 +129,7 @@ void JournalTree::markChanged(JournalNode& node, EventID id) {
 }
 
 void JournalTree::markListed(JournalNode& node, EventID id) {
-  node.directory->listed = id;
+  node.listed = id;
   for (JournalNode* at = &node; at && at->latest < id; at = at->parent) at->latest = id;
 }
 
@@ -150,9 +152,8 @@ void JournalTree::addEvents(std::string_view path, EventID since, std::vector<Jo
     if (name.empty() || name == ".") continue;
     // What is above `path` covers it when it was replaced or vanished; then `path` itself is what changed.
     if (node->changed > since) return collection.add(std::string(path), node->changed);
-    if (!node->directory) return;
-    const auto child = node->directory->children.find(name);
-    if (child == node->directory->children.end()) return;
+    const auto child = node->children.find(name);
+    if (child == node->children.end()) return;
     node = child->second.get();
     at.append(1, '/').append(name);
   }

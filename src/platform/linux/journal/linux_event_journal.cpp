@@ -4,32 +4,64 @@
 #include <system_error>
 #include <utility>
 
-#include "platform/linux/journal/journal_service.h"
-#include "platform/linux/journal/journal_subscription.h"
+#include "platform/guarded.h"
 
 namespace kel::platform {
 
-class LinuxEventJournal::Stream final : public JournalStream {
- public:
-  Stream(JournalService& service, std::shared_ptr<JournalSubscription> subscription)
-      : service_(service), subscription_(std::move(subscription)) {}
-  ~Stream() override { subscription_->close(); }
+namespace {
 
-  void setQueue(SerialQueue& queue) override { subscription_->setQueue(queue); }
+/// One reader of the journal. Its callback runs on its own queue, and never after `close`.
+struct Reader {
+  explicit Reader(JournalCallback toCall) : callback(std::move(toCall)) {}
+
+  const JournalCallback callback;
+  Guarded<SerialQueue*> queue;  // null when it is closed, or has not been opened
+
+  static void deliver(const std::shared_ptr<Reader>& reader, std::vector<JournalEvent> events) {
+    // Handed over while the reader cannot be closed: its queue is still there.
+    reader->queue.with([&](SerialQueue* open) {
+      if (!open) return;
+      open->async([reader, events = std::move(events)] {
+        if (reader->queue.copy()) reader->callback(events);
+      });
+    });
+  }
+};
+
+class Stream final : public JournalStream {
+ public:
+  Stream(JournalService& service, JournalCallback callback, std::vector<std::string> paths, EventID since,
+         bool watchesRoot)
+      : service_(service),
+        reader_(std::make_shared<Reader>(std::move(callback))),
+        paths_(std::move(paths)),
+        since_(since),
+        watchesRoot_(watchesRoot) {}
+  ~Stream() override { invalidate(); }
+
+  void setQueue(SerialQueue& queue) override { reader_->queue.set(&queue); }
 
   bool start() override {
-    if (!subscription_->hasQueue()) return false;
-    service_.subscribe(subscription_);
+    if (!reader_->queue.copy()) return false;
+    service_.eventsSince(since_, paths_, watchesRoot_, [reader = reader_](std::vector<JournalEvent> events) {
+      events.push_back({{}, event_flags::historyDone, 0});
+      Reader::deliver(reader, std::move(events));
+    });
     return true;
   }
 
-  void stop() override { subscription_->close(); }
-  void invalidate() override { subscription_->close(); }
+  void stop() override { reader_->queue.set(nullptr); }
+  void invalidate() override { reader_->queue.set(nullptr); }
 
  private:
   JournalService& service_;
-  const std::shared_ptr<JournalSubscription> subscription_;
+  const std::shared_ptr<Reader> reader_;
+  const std::vector<std::string> paths_;
+  const EventID since_;
+  const bool watchesRoot_;
 };
+
+}  // namespace
 
 LinuxEventJournal::LinuxEventJournal(JournalOptions options, FileSystem& files, SystemLog& log,
                                      ConcurrentQueue& pool)
@@ -66,7 +98,7 @@ JournalService* LinuxEventJournal::service() {
 
 EventID LinuxEventJournal::currentEventID() {
   JournalService* const running = service();
-  return running ? running->currentEventID() : static_cast<EventID>(options_.now());
+  return running ? running->currentEventID() : 0;
 }
 
 std::unique_ptr<JournalStream> LinuxEventJournal::createStream(JournalCallback callback,
@@ -75,14 +107,13 @@ std::unique_ptr<JournalStream> LinuxEventJournal::createStream(JournalCallback c
                                                                std::uint32_t flags) {
   JournalService* const running = service();
   if (!running) return nullptr;
-  return std::make_unique<Stream>(
-      *running, std::make_shared<JournalSubscription>(std::move(callback), paths, since,
-                                                      (flags & stream_flags::watchRoot) != 0));
+  return std::make_unique<Stream>(*running, std::move(callback), paths, since,
+                                  (flags & stream_flags::watchRoot) != 0);
 }
 
 bool LinuxEventJournal::changedSince(const std::vector<std::string>& paths, EventID since) {
   JournalService* const running = service();
-  return !running || running->changedSince(paths, since);
+  return !running || !running->eventsSince(since, paths, true).empty();
 }
 
 }  // namespace kel::platform

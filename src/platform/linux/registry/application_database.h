@@ -23,7 +23,7 @@ struct RememberedApplication {
 using RememberedApplications = std::map<std::string, RememberedApplication>;
 
 inline constexpr std::size_t largestApplicationDatabase = 64 * 1024 * 1024;
-inline constexpr std::string_view applicationDatabaseFormat = "kel applications 2 of " KEL_VERSION;
+inline constexpr std::string_view applicationDatabaseFormat = "kel applications 3 of " KEL_VERSION;
 
 /// The stored form, for this version of the program only; absent when it would be too large to be read back.
 std::optional<Bytes> encodeApplications(const RememberedApplications& applications);

@@ -1,7 +1,6 @@
 #include "platform/linux/registry/application_information.h"
 
 #include <cerrno>
-#include <fcntl.h>
 #include <utility>
 
 #include "platform/application_registry.h"
@@ -13,8 +12,8 @@
 namespace kel::platform {
 
 InformationStatus informationStatus(const std::string& application) {
-  const EntryRecord record = lookAtEntry(AT_FDCWD, informationPath(application).c_str());
-  InformationStatus result{record.isLink() ? record.target : record.status, true, false, record.isLink()};
+  const EntryLook look = lookAtEntry(informationPath(application));
+  InformationStatus result{look.status, true, false, look.isLink()};
   if (result.exists()) return result;
   const std::uint64_t error = std::exchange(result.status, {}).size;
   // Other errors say that there may be one which cannot be seen now: permissions, a disk, a server far away.
