@@ -50,8 +50,8 @@ kel::platform::Platform* platform(benchmark::State& state) {
   static const ScratchHome home{corpus};
   static kel::platform::LinuxPlatform linuxPlatform;
   static const bool isWatching [[maybe_unused]] = [] {
-    linuxPlatform.watchServiceDirectories(
-        kel::explicit_service_directories(linuxPlatform.platform().directories));
+    kel::platform::Platform& made = linuxPlatform.platform();
+    made.journal.watch(kel::explicit_service_directories(made.directories));
     return true;
   }();
   return &linuxPlatform.platform();
