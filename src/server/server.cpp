@@ -96,7 +96,7 @@ platform::SharedBytes KELServer::setCurrentPublicDictionariesAllowingNotificatio
     const std::lock_guard lock(changingList_);
     if (newData && queuedFlushes_ > 0) return newData;
     const platform::SharedBytes oldData = currentData();
-    if (newData == oldData || (newData && oldData && *newData == *oldData)) return newData;
+    if (newData == oldData || (newData && oldData && *newData == *oldData)) return oldData;
     currentData_.set(newData);
     schmutzItUpForKT(publicDictionaries.value_or(PropertyListArray()));
   }
