@@ -145,7 +145,7 @@ TEST_F(AppEntryTest, DirectoryThenBootVolumeThenPathLengthDecideBetweenCopies) {
            Row{"/Volumes/D/A.app", "/Volumes/D/Old/A.app", "path length"},
            Row{"/x/\u20ac\u20ac.app", "/x/\U0001F600a.app", "path length"},
        }) {
-    EXPECT_EQ(debugLines([&] { EXPECT_TRUE(wins(first, second)); }),
+    EXPECT_EQ(debugLines([&, &one = first, &other = second] { EXPECT_TRUE(wins(one, other)); }),
               "Collision resolution: preferring " + first + " to " + second + " due to " + reason);
     EXPECT_FALSE(wins(second, first)) << second << " over " << first;
   }
