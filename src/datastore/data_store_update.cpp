@@ -131,14 +131,18 @@ std::shared_ptr<KELPathChangesObserver> KELDataStore::readStaleSources(KELStaleC
 
   if (newLocators) pathsToLocators_ = std::move(newLocators);
   if (flags & KELStaleAppRegistryPaths) {
-    registryIsUnsettled_ = !newRegistryPaths.isWhole;
+    if (!std::exchange(registryIsUnsettled_, !newRegistryPaths.isWhole) && registryIsUnsettled_) {
+      platform_.log.write("Cannot be read for now, trying again: some applications");
+    }
     // A part of the applications takes the place of none, never that of all that were known.
     if (newRegistryPaths.isWhole || !pathsFromAR_ || pathsFromAR_->empty()) {
       pathsFromAR_ = std::make_shared<const std::vector<std::string>>(std::move(newRegistryPaths.paths));
     }
   }
   if (flags & KELStaleRestrictionLists) {
-    restrictionsAreUnsettled_ = newRestrictions.isTransient;
+    if (!std::exchange(restrictionsAreUnsettled_, newRestrictions.isTransient) && restrictionsAreUnsettled_) {
+      platform_.log.write("Cannot be read for now, trying again: " + newRestrictions.error);
+    }
     if (auto lists = restriction_lists_from_plist(newRestrictions.dictionary))
       restrictionLists_ = std::move(lists);
   }

@@ -115,6 +115,7 @@ void KELAppEntry::loadLocalizations(const std::vector<std::string>& localization
   const PropertyListDictionary* known = current ? current->asDictionary() : nullptr;
   PropertyListDictionaryBuilder tables;
   std::unique_ptr<platform::Bundle> bundle;
+  bool isSettled = true;
   for (const std::string& localization : localizations) {
     const PropertyListValue* earlier = known ? known->find(localization) : nullptr;
     if (earlier) {
@@ -124,13 +125,16 @@ void KELAppEntry::loadLocalizations(const std::vector<std::string>& localization
     // Opened for the first localization that nothing is known of, and then for all.
     if (!bundle && !(bundle = createBundle())) break;
     Value found = lookUpMenuStrings(*bundle, localization);
-    if (!found) break;
+    isSettled = found.has_value();
+    if (!isSettled) break;
     const bool usable = !isFalseMarker(*found);
     if (usable || tables.size() + (known ? known->size() : 0) < mostRemembered) {
       tables.set(localization, *std::move(found));
     }
     if (usable) break;
   }
+  // What failed earlier need not be asked for any more.
+  if (isSettled) stringsError_.clear();
   if (tables.size() == 0) return;
   if (known) {
     for (const auto& [localization, table] : *known) tables.set(localization, table);

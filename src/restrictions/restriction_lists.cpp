@@ -54,7 +54,7 @@ platform::DictionaryReading load_restrictions_file(platform::Platform& platform)
       platform::joinPath(platform::joinPath(libraries.back(), "CoreAgents"), restrictionsFileName);
   platform::DictionaryReading reading =
       platform::readDictionaryFile(platform.files, path, platform::largestForeignFile);
-  if (!reading.dictionary && platform.files.exists(path)) {
+  if (!reading.dictionary && !reading.isTransient && platform.files.exists(path)) {
     platform.log.write("Cannot read the restrictions file " + path + ": " + reading.error);
   }
   return reading;

@@ -108,6 +108,8 @@ TEST_F(AppEntryTest, LocalizationWalkStopsAtTheFirstUsableFileAndRemembersTheMis
   for (int attempt = 0; attempt < 2; ++attempt) load({"German", "English"});
   EXPECT_TRUE(entry->isUnsettled() && entry->localizationToMenuStrings() == Value("damaged"));
   EXPECT_THAT(system.log.take(), SizeIs(1)) << "what may pass is told once, and is no answer";
+  load({});
+  EXPECT_FALSE(entry->isUnsettled()) << "what nobody asks for any more is looked for";
   system.bundles.opens = 0;
   system.files.setFailing({});
   EXPECT_EQ(load({"French", "German", "English"}),
